@@ -11,6 +11,10 @@ if(APPSYNC_SANITIZE)
   add_link_options(-fsanitize=${APPSYNC_SANITIZE})
 endif()
 
+# Read once for each target. No source may rely on it: the release preset builds without.
+set(APPSYNC_STANDARD_HEADERS <algorithm> <array> <atomic> <chrono> <condition_variable> <functional> <map> <memory>
+    <mutex> <optional> <set> <span> <string> <string_view> <thread> <unordered_map> <utility> <vector>)
+
 # appsync_layer(NAME FOLDERS folder... [USES layer...] [EXECUTABLE])
 function(appsync_layer name)
   cmake_parse_arguments(LAYER "EXECUTABLE" "" "FOLDERS;USES" ${ARGN})
@@ -29,5 +33,6 @@ function(appsync_layer name)
     add_library(${name} STATIC ${sources})
   endif()
   target_include_directories(${name} PUBLIC ${include})
+  target_precompile_headers(${name} PRIVATE ${APPSYNC_STANDARD_HEADERS})
   target_link_libraries(${name} PUBLIC ${LAYER_USES})
 endfunction()

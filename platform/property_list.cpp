@@ -229,11 +229,7 @@ bool dropReference(Bits node) noexcept {
 }
 
 void freeNode(Bits node) noexcept {
-  if (Internals::tag(node) == Internals::kData) {
-    delete Internals::node<DataNode>(node);
-  } else {
-    ::operator delete(Internals::node<void>(node));
-  }
+  ::operator delete(Internals::node<void>(node));
 }
 
 // --- description
@@ -367,7 +363,7 @@ bool leavesAreEqual(const PropertyList& a, const PropertyList& b) {
     case PropertyList::Type::Date:
       return *a.date() == *b.date() || (std::isnan(*a.date()) && std::isnan(*b.date()));
     case PropertyList::Type::Data:
-      return *a.data() == *b.data();
+      return std::ranges::equal(*a.data(), *b.data());
     case PropertyList::Type::UID:
       return a.uid() == b.uid();
     case PropertyList::Type::Array:
@@ -538,8 +534,11 @@ PropertyList PropertyList::date(double secondsSince2001) {
   return Internals::adopt(realBits(secondsSince2001, Internals::kDate, Internals::kDateNode));
 }
 
-PropertyList PropertyList::data(Bytes bytes) {
-  return Internals::adopt(Internals::tagged(new DataNode{1, std::move(bytes)}, Internals::kData));
+PropertyList PropertyList::data(std::span<const std::uint8_t> bytes) {
+  void* memory = ::operator new(sizeof(DataNode) + bytes.size());
+  auto* node = ::new (memory) DataNode{1, bytes.size()};
+  if (!bytes.empty()) std::memcpy(Internals::bytes(node), bytes.data(), bytes.size());
+  return Internals::adopt(Internals::tagged(node, Internals::kData));
 }
 
 PropertyList PropertyList::uid(std::uint64_t value) {
@@ -660,8 +659,10 @@ std::optional<double> PropertyList::date() const {
   }
 }
 
-const Bytes* PropertyList::data() const {
-  return Internals::tag(_bits) == Internals::kData ? &Internals::node<DataNode>(_bits)->bytes : nullptr;
+std::optional<std::span<const std::uint8_t>> PropertyList::data() const {
+  if (Internals::tag(_bits) != Internals::kData) return std::nullopt;
+  auto* node = Internals::node<DataNode>(_bits);
+  return std::span<const std::uint8_t>(Internals::bytes(node), node->size);
 }
 
 std::optional<std::uint64_t> PropertyList::uid() const {

@@ -14,6 +14,7 @@
 #include <initializer_list>
 #include <iterator>
 #include <optional>
+#include <span>
 #include <string>
 #include <string_view>
 #include <type_traits>
@@ -64,7 +65,7 @@ class PropertyList {
   static PropertyList real(double value);
   static PropertyList real32(float value);  // keeps its width when written; equal to the `real` of the same value
   static PropertyList date(double secondsSince2001);  // seconds since 2001-01-01T00:00:00Z, may be fractional
-  static PropertyList data(Bytes bytes);
+  static PropertyList data(std::span<const std::uint8_t> bytes);  // copies them
   static PropertyList uid(std::uint64_t value);
   static PropertyList array(std::vector<PropertyList> elements = {});
   static PropertyList dictionary(std::vector<std::pair<std::string, PropertyList>> members = {});  // a later key wins
@@ -86,7 +87,7 @@ class PropertyList {
   // with a digit 1 to 9 or one of "YyTt" after blanks, signs and zeros; none for every other type.
   std::optional<bool> flag() const;
   std::optional<double> date() const;
-  const Bytes* data() const;  // valid as long as this value (or a copy of it) is unchanged
+  std::optional<std::span<const std::uint8_t>> data() const;  // valid as long as this value (or a copy) is unchanged
   std::optional<std::uint64_t> uid() const;
 
   // --- arrays and dictionaries -------------------------------------------------------------------------------------

@@ -413,7 +413,7 @@ PropertyList BinaryReader::readData(std::size_t offset) {
   std::size_t body = 0;
   const std::size_t size = readCount(offset, body);
   claim(offset, body, size);
-  return PropertyList::data(Bytes(_bytes + body, _bytes + body + size));
+  return PropertyList::data({_bytes + body, size});
 }
 
 PropertyList BinaryReader::readASCII(std::size_t offset) {

@@ -34,7 +34,7 @@ struct ScalarNode {
 
 struct DataNode {
   std::atomic<std::uint64_t> references;
-  Bytes bytes;
+  std::size_t size;  // the bytes follow the node
 };
 
 struct ArrayNode {
@@ -100,6 +100,7 @@ struct PropertyListInternals {
     auto* found = node<StringNode>(string);
     return {text(found), found->size};
   }
+  static std::uint8_t* bytes(DataNode* node) { return reinterpret_cast<std::uint8_t*>(node + 1); }
   static double payloadAsReal(Bits bits) { return std::bit_cast<double>(node<ScalarNode>(bits)->payload); }
 
   // The values inside an array, or the keys and values of a dictionary in turn (where a key may be a hole).

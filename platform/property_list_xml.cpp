@@ -516,7 +516,7 @@ std::optional<PropertyList> dataFrom(std::string_view text) {
     for (const int shift : {10, 2}) bytes.push_back(static_cast<std::uint8_t>(group >> shift));
   }
   if (padding == 2) bytes.push_back(static_cast<std::uint8_t>(group >> 4));
-  return PropertyList::data(std::move(bytes));
+  return PropertyList::data(bytes);
 }
 
 // The strings that were read last, so that the same keys and values over and over are one node. A string that pushes
@@ -732,7 +732,7 @@ class XMLWriter {
   void writeEscaped(std::string_view text);
   void writeReal(double value);
   void writeDate(double value);
-  void writeData(const Bytes& bytes);
+  void writeData(std::span<const std::uint8_t> bytes);
   void writeUID(std::uint64_t value);
 
   void checkDepth() const {
@@ -866,7 +866,7 @@ void XMLWriter::writeDate(double value) {
   writeText("date", *text);
 }
 
-void XMLWriter::writeData(const Bytes& bytes) {
+void XMLWriter::writeData(std::span<const std::uint8_t> bytes) {
   static constexpr std::string_view alphabet = "ABCDEFGHIJKLMNOPQRSTUVWXYZabcdefghijklmnopqrstuvwxyz0123456789+/";
   constexpr std::size_t bytesPerLine = 57;
   put("<data>\n");

@@ -219,7 +219,7 @@ TEST(PropertyList, DictionariesOfAnySizeKeepTheirOrderThroughChanges) {
 
 TEST(PropertyList, DescriptionsAreOneBoundedLine) {
   EXPECT_EQ(PL::dictionary({{"a", PL::array({PL::integer(-1), PL::real(1.5), PL(true)})},
-                            {"b", PL::data({1, 2})},
+                            {"b", PL::data(Bytes{1, 2})},
                             {"c", PL::date(1)},
                             {"d", PL::uid(3)}})
                 .description(),
@@ -295,7 +295,7 @@ TEST(PropertyListXML, ReadsWhatDocumentsMayBringAlong) {
       {"<real>-Infinity</real>", PL::real(-std::numeric_limits<double>::infinity())},
       {"<real>+inf</real>", PL::real(std::numeric_limits<double>::infinity())},
       {"<date>2024-02-29T12:34:56Z</date>", PL::date(730902896)},
-      {"<data>\n\tAQ ID\n\tBA==\n</data>", PL::data({1, 2, 3, 4})},
+      {"<data>\n\tAQ ID\n\tBA==\n</data>", PL::data(Bytes{1, 2, 3, 4})},
       {"\xEF\xBB\xBF" + head + "<string>ü</string>", PL("ü")},
   };
   for (const auto& [xml, value] : cases) EXPECT_EQ(parsed(xml), value) << xml;
@@ -382,7 +382,7 @@ TEST(PropertyListBinary, ReadsHandMadeBytes) {
       {binary({"\x14" + std::string(16, '\xFF')}), PL::integer(-1)},
       {binary({"\x22\x3F\x80\0\0"_s}), PL::real(1)},
       {binary({"\x33\0\0\0\0\0\0\0\0"_s}), PL::date(0)},
-      {binary({"\x42\x01\x02"}), PL::data({1, 2})},
+      {binary({"\x42\x01\x02"}), PL::data(Bytes{1, 2})},
       {binary({"\x5F\x10\x03"
                "abc"}),
        PL("abc")},
