@@ -1,0 +1,269 @@
+// What the registry shows in a device's status, and what a seed can put into it.
+#include <algorithm>
+#include <array>
+#include <string_view>
+#include <utility>
+
+#include "embedded/device.h"
+#include "embedded/file_manager.h"
+#include "embedded/fresh_container.h"
+#include "embedded/registry.h"
+
+namespace appsync {
+
+namespace {
+
+constexpr std::uint64_t kLargestFile = 1ULL << 40;
+
+// --- status --------------------------------------------------------------------------------------
+
+void copyInstall(const std::optional<SeededInstall>& seeded, PropertyList& entry) {
+  if (!seeded) return;
+  if (seeded->installState) entry.set("installState", PropertyList::unsignedInteger(*seeded->installState));
+  if (seeded->installPhase) entry.set("installPhase", PropertyList::unsignedInteger(*seeded->installPhase));
+  if (seeded->prioritized) entry.set("prioritized", *seeded->prioritized);
+  if (!seeded->progress) entry.set("progress", false);
+}
+
+// --- checks --------------------------------------------------------------------------------------
+
+enum class Wanted : std::uint8_t { Text, Number, Size, Flag, Dictionary, ApplicationType, FileSizes };
+
+struct Field {
+  std::string_view key;
+  Wanted wanted;
+};
+
+constexpr std::array kInstallFields = {Field{"installState", Wanted::Number}, Field{"installPhase", Wanted::Number},
+                                       Field{"prioritized", Wanted::Flag}, Field{"progress", Wanted::Flag}};
+constexpr std::array kCommonFields = {Field{"version", Wanted::Text}, Field{"name", Wanted::Text},
+                                      Field{"type", Wanted::ApplicationType}};
+constexpr std::array kInstalledFields = {Field{"size", Wanted::Size}, Field{"files", Wanted::FileSizes},
+                                         Field{"storeMetadata", Wanted::Dictionary}};
+constexpr std::array kPlaceholderFields = {Field{"installType", Wanted::Number},
+                                           Field{"launchProhibited", Wanted::Flag}};
+
+// A place below the bundle at which a seed may put a file.
+bool isInnerPath(std::string_view path) {
+  while (true) {
+    const std::size_t slash = path.find('/');
+    if (!isSinglePathComponent(std::string(path.substr(0, slash)))) return false;
+    if (slash == std::string_view::npos) return true;
+    path.remove_prefix(slash + 1);
+  }
+}
+
+bool areFileSizes(const PropertyList& files) {
+  for (const PropertyList::Member& file : files.members()) {
+    if (!isInnerPath(file.key) || file.key == "Info.plist") return false;
+    if (file.value.unsignedInteger().value_or(UINT64_MAX) > kLargestFile) return false;
+    // No file can stand where another one needs a directory.
+    for (std::size_t slash = file.key.find('/'); slash != std::string_view::npos;
+         slash = file.key.find('/', slash + 1)) {
+      const std::string_view parent = file.key.substr(0, slash);
+      if (parent == "Info.plist" || files.find(parent) != nullptr) return false;
+    }
+  }
+  return files.isDictionary();
+}
+
+// What is wrong with the value; empty: nothing.
+std::string_view complaint(const PropertyList& value, Wanted wanted) {
+  switch (wanted) {
+    case Wanted::Text:
+      return value.isString() ? "" : "must be a string";
+    case Wanted::Number:
+      return value.unsignedInteger() ? "" : "must be a whole number that is not negative";
+    case Wanted::Size:
+      return value.unsignedInteger().value_or(UINT64_MAX) <= kLargestFile ? "" : "must be a size of at most 1 TiB";
+    case Wanted::Flag:
+      return value.boolean() ? "" : "must be true or false";
+    case Wanted::Dictionary:
+      return value.isDictionary() ? "" : "must be a dictionary";
+    case Wanted::ApplicationType:
+      return value.string() == "User" || value.string() == "System" ? "" : "must be \"User\" or \"System\"";
+    case Wanted::FileSizes:
+      return areFileSizes(value) ? ""
+                                 : "must be a dictionary of sizes (at most 1 TiB) by the files' names in the bundle, "
+                                   "without Info.plist";
+  }
+  return "";
+}
+
+template <std::size_t N>
+bool checkFields(const PropertyList& entry, const std::array<Field, N>& fields, const std::string& where,
+                 ErrorOut error) {
+  return std::all_of(fields.begin(), fields.end(), [&](const Field& field) {
+    const PropertyList* value = entry.find(field.key);
+    const std::string_view wrong = value == nullptr ? "" : complaint(*value, field.wanted);
+    if (wrong.empty()) return true;
+    setError(error, Error(std::string(kDeviceErrorDomain), kDeviceBadSeed,
+                          where + ": \"" + std::string(field.key) + "\" " + std::string(wrong)));
+    return false;
+  });
+}
+
+template <std::size_t N>
+bool checkEntries(const std::string& list, const PropertyList& entries, const std::array<Field, N>& fields,
+                  ErrorOut error) {
+  const auto refuse = [&](const std::string& text) {
+    setError(error, Error(std::string(kDeviceErrorDomain), kDeviceBadSeed, text));
+    return false;
+  };
+  if (!entries.isArray()) return refuse(list + " must be an array of dictionaries");
+  std::size_t index = 0;
+  for (const PropertyList& entry : entries.elements()) {
+    std::string where = list + "[" + std::to_string(index++) + "]";
+    const PropertyList* identifier = entry.find("identifier");
+    if (identifier == nullptr || !isSinglePathComponent(identifier->string().value_or(""))) {
+      return refuse(where + " must be a dictionary whose \"identifier\" is a bundle identifier");
+    }
+    where += " (" + *identifier->string() + ")";
+    if (!checkFields(entry, kCommonFields, where, error) || !checkFields(entry, kInstallFields, where, error) ||
+        !checkFields(entry, fields, where, error)) {
+      return false;
+    }
+  }
+  return true;
+}
+
+// --- entries -------------------------------------------------------------------------------------
+
+std::optional<std::string> text(const PropertyList& entry, std::string_view key) {
+  const PropertyList* value = entry.find(key);
+  return value == nullptr ? std::nullopt : value->string();
+}
+
+std::optional<std::uint64_t> number(const PropertyList& entry, std::string_view key) {
+  const PropertyList* value = entry.find(key);
+  return value == nullptr ? std::nullopt : value->unsignedInteger();
+}
+
+std::optional<bool> flag(const PropertyList& entry, std::string_view key) {
+  const PropertyList* value = entry.find(key);
+  return value == nullptr ? std::nullopt : value->boolean();
+}
+
+std::optional<SeededInstall> installOf(const PropertyList& entry) {
+  bool named = false;
+  for (const Field& field : kInstallFields) named |= entry.find(field.key) != nullptr;
+  if (!named) return std::nullopt;
+  return SeededInstall{number(entry, "installState"), number(entry, "installPhase"), flag(entry, "prioritized"),
+                       flag(entry, "progress").value_or(true)};
+}
+
+bool addParents(FreshContainer& container, std::set<std::string>& made, std::string_view path, ErrorOut error) {
+  for (std::size_t slash = path.find('/'); slash != std::string_view::npos; slash = path.find('/', slash + 1)) {
+    const std::string parent(path.substr(0, slash));
+    if (made.insert(parent).second && !container.directory(parent, error)) return false;
+  }
+  return true;
+}
+
+bool addFiles(FreshContainer& container, const PropertyList& entry, ErrorOut error) {
+  const PropertyList* files = entry.find("files");
+  if (files == nullptr) {
+    // One file makes up for what the property lists do not weigh.
+    const std::uint64_t wanted = number(entry, "size").value_or(0);
+    const std::uint64_t there = container.size();
+    return wanted <= there || container.emptyFile("content", wanted - there, error);
+  }
+  std::set<std::string> made;
+  for (const PropertyList::Member& file : files->members()) {
+    if (!addParents(container, made, file.key, error) ||
+        !container.emptyFile(std::string(file.key), *file.value.unsignedInteger(), error)) {
+      return false;
+    }
+  }
+  return true;
+}
+
+bool fillContainer(FreshContainer& container, const InstalledApplication& application, const PropertyList& entry,
+                   ErrorOut error) {
+  PropertyList info = PropertyList::dictionary({{"TefBundleIdentifier", application.bundleID}});
+  if (application.bundleVersion) info.set("TefBundleVersion", *application.bundleVersion);
+  if (!application.name.empty()) info.set("TefBundleDisplayName", application.name);
+  const PropertyList* metadata = entry.find("storeMetadata");
+  return container.bundle(application.bundleID + ".app", error) && container.propertyList("Info.plist", info, error) &&
+         (metadata == nullptr || container.propertyListBeside("TarvoMetadata.plist", *metadata, error)) &&
+         addFiles(container, entry, error) && container.keep(error);
+}
+
+}  // namespace
+
+PropertyList registryInstalledStatus(const StateStore& store) {
+  PropertyList entries = PropertyList::array();
+  for (const auto& [bundleID, record] : loadApplicationRecords(store, nullptr)) {
+    const InstalledApplication& application = record.application;
+    PropertyList entry = PropertyList::dictionary({{"identifier", bundleID}});
+    if (application.bundleVersion) entry.set("version", *application.bundleVersion);
+    entry.set("name", application.name.empty() ? bundleID : application.name);
+    entry.set("type", application.applicationType);
+    entry.set("size", PropertyList::unsignedInteger(application.size));
+    entry.set("container", application.containerPath.substr(1));
+    copyInstall(application.seeded, entry);
+    entries.append(std::move(entry));
+  }
+  return entries;
+}
+
+PropertyList registryPlaceholdersStatus(const StateStore& store) {
+  PropertyList entries = PropertyList::array();
+  for (const auto& [bundleID, record] : loadPlaceholderRecords(store, nullptr)) {
+    PropertyList entry = PropertyList::dictionary({{"identifier", bundleID}, {"name", record.name}});
+    entry.set("installType", PropertyList::unsignedInteger(record.installType));
+    if (record.bundleVersion) entry.set("version", *record.bundleVersion);
+    entry.set("launchProhibited", record.launchProhibited);
+    entry.set("type", record.applicationType);
+    copyInstall(record.seeded, entry);
+    entries.append(std::move(entry));
+  }
+  return entries;
+}
+
+bool checkInstalledSeed(const PropertyList& entries, ErrorOut error) {
+  return checkEntries("installed", entries, kInstalledFields, error);
+}
+
+bool checkPlaceholdersSeed(const PropertyList& entries, ErrorOut error) {
+  return checkEntries("placeholders", entries, kPlaceholderFields, error);
+}
+
+bool seedInstalled(EmbeddedRegistry& registry, EmbeddedFileManager& files, const PropertyList& entries,
+                   ErrorOut error) {
+  for (const PropertyList& entry : entries.elements()) {
+    InstalledApplication application;
+    application.bundleID = text(entry, "identifier").value_or("");
+    application.name = text(entry, "name").value_or("");
+    application.bundleVersion = text(entry, "version");
+    application.applicationType = text(entry, "type").value_or("User");
+    application.seeded = installOf(entry);
+    FreshContainer container(files, kContainersDirectory, registry.newContainerName(),
+                             "The application \"" + application.bundleID + "\"");
+    if (!fillContainer(container, application, entry, error)) return false;
+    application.containerPath = container.path();
+    application.bundlePath = container.bundlePath();
+    application.size = container.size();
+    if (registry.seedApplication(application, error)) continue;
+    files.removeItem(container.path(), nullptr);
+    return false;
+  }
+  return true;
+}
+
+bool seedPlaceholders(EmbeddedRegistry& registry, const PropertyList& entries, ErrorOut error) {
+  for (const PropertyList& entry : entries.elements()) {
+    PlaceholderDescription description;
+    description.bundleID = text(entry, "identifier").value_or("");
+    description.name = text(entry, "name").value_or(description.bundleID);
+    description.installType = number(entry, "installType").value_or(0);
+    description.applicationType = text(entry, "type").value_or("User");
+    description.bundleVersion = text(entry, "version");
+    description.launchProhibited = flag(entry, "launchProhibited").value_or(false);
+    description.seeded = installOf(entry);
+    if (!registry.installPlaceholder(description, error)) return false;
+  }
+  return true;
+}
+
+}  // namespace appsync

@@ -1,0 +1,161 @@
+#include "embedded/state_store.h"
+
+#include <algorithm>
+#include <cerrno>
+#include <string_view>
+#include <utility>
+
+#include "embedded/file_manager.h"
+
+namespace appsync {
+
+namespace {
+
+constexpr char kStateDirectory[] = "/state";
+constexpr std::string_view kRecordSuffix = ".plist";
+constexpr std::string_view kDamagedSuffix = ".damaged";
+
+// "COLLECTION/KEY" or a single word, and nothing that leads elsewhere.
+bool isRecordName(const std::string& name) {
+  const std::size_t slash = name.find('/');
+  if (slash == std::string::npos) return isSinglePathComponent(name);
+  return isSinglePathComponent(name.substr(0, slash)) && isSinglePathComponent(name.substr(slash + 1));
+}
+
+std::string pathOfRecord(const std::string& name) {
+  return std::string(kStateDirectory) + "/" + name + std::string(kRecordSuffix);
+}
+
+Error refusedName(const std::string& name) {
+  return Error(std::string(kFileErrorDomain), EINVAL, "\"" + name + "\" cannot be the name of a record");
+}
+
+// None when there is no such file or it cannot be read; only the latter sets the error.
+std::optional<PropertyList> readRecord(EmbeddedFileManager& files, const std::string& path, ErrorOut error) {
+  std::optional<Error> reason;
+  const std::optional<Bytes> bytes = files.readFile(path, &reason);
+  if (!bytes) {
+    if (reason->code() != ENOENT) setError(error, reason);
+    return std::nullopt;
+  }
+  std::optional<PropertyList> value = parsePropertyList(*bytes, &reason);
+  if (!value) {
+    setError(error, Error(std::string(kFileErrorDomain), EILSEQ,
+                          "The record \"" + files.hostPath(path) + "\" cannot be read", *reason));
+  }
+  return value;
+}
+
+class FileStateStore : public StateStore {
+ public:
+  explicit FileStateStore(EmbeddedFileManager& files) : _files(files.ownFiles()) {}
+
+  std::optional<PropertyList> load(const std::string& name, ErrorOut error) const override {
+    if (isRecordName(name)) return readRecord(_files, pathOfRecord(name), error);
+    setError(error, refusedName(name));
+    return std::nullopt;
+  }
+
+  bool save(const std::string& name, const PropertyList& value, ErrorOut error) override {
+    if (!isRecordName(name)) {
+      setError(error, refusedName(name));
+      return false;
+    }
+    const std::optional<Bytes> bytes = serializePropertyList(value, PropertyListFormat::Binary, error);
+    if (!bytes) return false;
+    const std::string path = pathOfRecord(name);
+    const std::string directory = path.substr(0, path.rfind('/'));
+    if (!_files.isDirectory(directory) && !_files.createDirectory(directory, true, {}, error)) return false;
+    return _files.writeFile(path, *bytes, error);
+  }
+
+  bool remove(const std::string& name, ErrorOut error) override {
+    std::optional<Error> reason = isRecordName(name) ? std::nullopt : std::optional(refusedName(name));
+    if (!reason && !_files.removeItem(pathOfRecord(name), &reason) && reason->code() == ENOENT) reason.reset();
+    if (reason) setError(error, reason);
+    return !reason;
+  }
+
+  std::vector<std::string> keys(const std::string& collection) const override {
+    std::vector<std::string> keys;
+    if (!isSinglePathComponent(collection)) return keys;
+    const auto names = _files.contentsOfDirectory(std::string(kStateDirectory) + "/" + collection, nullptr);
+    for (const std::string& name : names.value_or(std::vector<std::string>{})) {
+      if (name.ends_with(kRecordSuffix)) keys.push_back(name.substr(0, name.size() - kRecordSuffix.size()));
+    }
+    std::sort(keys.begin(), keys.end());
+    return keys;
+  }
+
+ private:
+  mutable EmbeddedFileManager _files;  // reading changes nothing in it
+};
+
+bool repairRecord(EmbeddedFileManager& files, const std::string& path, std::vector<std::string>& repairs,
+                  ErrorOut error) {
+  std::optional<Error> reason;
+  if (readRecord(files, path, &reason) || !reason) return true;
+  const std::string aside = path + std::string(kDamagedSuffix);
+  files.removeItem(aside, nullptr);
+  if (!files.moveItem(path, aside, error)) return false;
+  repairs.push_back(reason->description() + "; it has been moved to \"" + files.hostPath(aside) +
+                    "\" and the device goes on without it");
+  return true;
+}
+
+bool repairRecordsIn(EmbeddedFileManager& files, const std::string& directory, int depth,
+                     std::vector<std::string>& repairs, ErrorOut error) {
+  const auto names = files.contentsOfDirectory(directory, error);
+  if (!names) return false;
+  for (const std::string& name : *names) {
+    const std::string path = std::string(directory).append("/").append(name);
+    if (name.ends_with(kRecordSuffix)) {
+      if (!repairRecord(files, path, repairs, error)) return false;
+    } else if (depth > 0 && files.isDirectory(path)) {
+      if (!repairRecordsIn(files, path, depth - 1, repairs, error)) return false;
+    }
+  }
+  return true;
+}
+
+// The length of the UTF-8 sequence at the start of the text; 0 when there is none that is valid.
+std::size_t validSequence(std::string_view text) {
+  const auto byte = [&](std::size_t at) { return static_cast<unsigned char>(text[at]); };
+  const unsigned first = byte(0);
+  if (first < 0x80) return 1;
+  const std::size_t length = first >= 0xF0 ? 4 : first >= 0xE0 ? 3 : 2;
+  if (first < 0xC2 || first > 0xF4 || text.size() < length) return 0;
+  for (std::size_t i = 1; i < length; ++i) {
+    if ((byte(i) & 0xC0U) != 0x80) return 0;
+  }
+  // Overlong forms, surrogates, and what is beyond the last character.
+  const unsigned second = byte(1);
+  if ((first == 0xE0 && second < 0xA0) || (first == 0xED && second > 0x9F)) return 0;
+  if ((first == 0xF0 && second < 0x90) || (first == 0xF4 && second > 0x8F)) return 0;
+  return length;
+}
+
+}  // namespace
+
+std::unique_ptr<StateStore> makeFileStateStore(EmbeddedFileManager& files) {
+  return std::make_unique<FileStateStore>(files);
+}
+
+bool repairStateRecords(EmbeddedFileManager& files, std::vector<std::string>& repairs, ErrorOut error) {
+  EmbeddedFileManager own = files.ownFiles();
+  return repairRecordsIn(own, kStateDirectory, 1, repairs, error);
+}
+
+bool isSinglePathComponent(const std::string& text) {
+  constexpr std::size_t kLongest = 200;
+  if (text.empty() || text == "." || text == ".." || text.size() > kLongest) return false;
+  if (text.find('/') != std::string::npos || text.find('\0') != std::string::npos) return false;
+  for (std::size_t at = 0; at < text.size();) {
+    const std::size_t length = validSequence(std::string_view(text).substr(at));
+    if (length == 0) return false;
+    at += length;
+  }
+  return true;
+}
+
+}  // namespace appsync

@@ -1,0 +1,45 @@
+// The embedded device's own records: property lists in DIR/state, each in a file of its own and replaced in one step.
+//
+// A record's name is "COLLECTION/KEY" or a single word; a key is a bundle identifier or another single path component.
+#pragma once
+
+#include <memory>
+#include <optional>
+#include <string>
+#include <vector>
+
+#include "platform/error.h"
+#include "platform/property_list.h"
+
+namespace appsync {
+
+class EmbeddedFileManager;
+
+// Any thread; whoever reads, changes and writes one record holds a lock of their own meanwhile.
+class StateStore {
+ public:
+  virtual ~StateStore() = default;
+
+  // None when there is no such record or it cannot be read; only the latter sets the error.
+  virtual std::optional<PropertyList> load(const std::string& name, ErrorOut error) const = 0;
+  // Durable when it answers true; false leaves the old record.
+  virtual bool save(const std::string& name, const PropertyList& value, ErrorOut error) = 0;
+  // A record that is not there is no failure.
+  virtual bool remove(const std::string& name, ErrorOut error) = 0;
+  // The keys of a collection, sorted.
+  virtual std::vector<std::string> keys(const std::string& collection) const = 0;
+};
+
+// Records as binary property lists at DIR/state/NAME.plist of the device whose files these are; directories are made
+// with the first record in them. Errors name the file.
+std::unique_ptr<StateStore> makeFileStateStore(EmbeddedFileManager& files);
+
+// Reads every record, and moves one that cannot be read aside to NAME.plist.damaged, so that its service goes on
+// without it. Appends a line for each to `repairs`; false, with an error, when one can be neither read nor moved.
+bool repairStateRecords(EmbeddedFileManager& files, std::vector<std::string>& repairs, ErrorOut error);
+
+// Whether this can be the name of one file or directory of an application: not empty, not "." or "..", no "/" and no
+// NUL, valid UTF-8 and at most 200 bytes. The services of the device refuse every other bundle identifier.
+bool isSinglePathComponent(const std::string& text);
+
+}  // namespace appsync
