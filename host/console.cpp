@@ -1,0 +1,82 @@
+#include "host/console.h"
+
+#include <sys/ioctl.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <cerrno>
+#include <cstring>
+
+#include "host/json.h"
+#include "host/text.h"
+
+namespace appsync {
+
+bool Console::isTerminal() const {
+  return !_json && !_quiet && ::isatty(STDOUT_FILENO) == 1;
+}
+
+std::size_t Console::columns() const {
+  winsize size{};
+  if (::ioctl(STDOUT_FILENO, TIOCGWINSZ, &size) != 0 || size.ws_col == 0) return 80;
+  return std::max<std::size_t>(size.ws_col, 20);
+}
+
+std::size_t Console::rows() const {
+  winsize size{};
+  if (::ioctl(STDOUT_FILENO, TIOCGWINSZ, &size) != 0 || size.ws_row == 0) return 24;
+  return std::max<std::size_t>(size.ws_row, 4);
+}
+
+void Console::line(std::string_view text) {
+  if (!_quiet) failureLine(text);
+}
+
+void Console::failureLine(std::string_view text) {
+  if (!_json) raw(printable(text) + "\n");
+}
+
+void Console::raw(std::string_view bytes) {
+  const int error = writeAll(STDOUT_FILENO, bytes);
+  if (error != 0 && error != EPIPE) _outputError = error;
+}
+
+void Console::document(const Json& fields) {
+  if (!_json) return;
+  Json document = Json::object();
+  document["schema"] = 1;
+  for (const auto& [key, value] : fields.items()) document[key] = value;
+  raw(jsonText(document) + "\n");
+}
+
+void Console::problem(std::string_view text) {
+  writeAll(STDERR_FILENO, "dovel: " + printable(text) + "\n");
+}
+
+int Console::fail(const Failure& failure) {
+  const FailureKind& kind = failureKind(failure.code);
+  problem(failure.hint.empty() ? failure.message : failure.message + "; " + failure.hint);
+  document({{"ok", false}, {"error", {{"code", kind.name}, {"message", failure.message}, {"hint", failure.hint}}}});
+  return kind.status;
+}
+
+std::optional<Failure> Console::outputFailure() const {
+  if (_outputError == 0) return std::nullopt;
+  return Failure{FailureCode::OutputUnwritable,
+                 "standard output cannot be written: " + std::string(std::strerror(_outputError)),
+                 "send it to a place with room for it"};
+}
+
+int writeAll(int file, std::string_view bytes) {
+  while (!bytes.empty()) {
+    const ssize_t written = ::write(file, bytes.data(), bytes.size());
+    if (written < 0) {
+      if (errno == EINTR) continue;
+      return errno;
+    }
+    bytes.remove_prefix(static_cast<std::size_t>(written));
+  }
+  return 0;
+}
+
+}  // namespace appsync

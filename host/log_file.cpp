@@ -1,0 +1,91 @@
+#include "host/log_file.h"
+
+#include <fcntl.h>
+#include <unistd.h>
+
+#include <array>
+#include <cerrno>
+#include <cstdio>
+#include <ctime>
+
+#include "host/console.h"
+#include "host/files.h"
+
+namespace appsync {
+
+namespace {
+
+std::string escaped(std::string_view message) {
+  std::string text;
+  text.reserve(message.size());
+  for (const char c : message) {
+    switch (c) {
+      case '\n':
+        text += "\\n";
+        break;
+      case '\t':
+        text += "\\t";
+        break;
+      case '\\':
+        text += "\\\\";
+        break;
+      default:
+        text += c;
+    }
+  }
+  return text;
+}
+
+}  // namespace
+
+std::unique_ptr<LogFile> LogFile::open(const std::string& path, Failure& failure) {
+  if (path == "-") return std::unique_ptr<LogFile>(new LogFile(path, STDERR_FILENO));
+  const int file = ::open(path.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, 0666);
+  if (file < 0) {
+    failure = outputFailure(path, errno);
+    return nullptr;
+  }
+  return std::unique_ptr<LogFile>(new LogFile(path, file));
+}
+
+LogFile::~LogFile() {
+  if (_file != STDERR_FILENO) ::close(_file);
+}
+
+void LogFile::line(const LogLine& line) {
+  add(line.time, line.level, line.category, line.message);
+}
+
+void LogFile::transaction(const TransactionRecord& record) {
+  add(record.time, LogLevel::Default, "transaction", record.message());
+}
+
+void LogFile::add(std::chrono::system_clock::time_point time, LogLevel level, std::string_view category,
+                  std::string_view message) {
+  if (_error != 0) return;
+  std::string text = rfc3339(time);
+  text += level == LogLevel::Error ? "\terror\t" : "\tdefault\t";
+  text += category;
+  text += '\t';
+  text += escaped(message) + '\n';
+  _error = writeAll(_file, text);
+}
+
+std::optional<Failure> LogFile::writeFailure() const {
+  if (_error == 0 || _error == EPIPE) return std::nullopt;
+  return outputFailure(_path, _error);
+}
+
+std::string rfc3339(std::chrono::system_clock::time_point time) {
+  const auto microseconds = std::chrono::duration_cast<std::chrono::microseconds>(time.time_since_epoch()).count();
+  const std::time_t seconds = microseconds / 1'000'000;
+  std::tm calendar{};
+  ::gmtime_r(&seconds, &calendar);
+  std::array<char, 80> text{};
+  std::snprintf(text.data(), text.size(), "%04d-%02d-%02dT%02d:%02d:%02d.%06dZ", calendar.tm_year + 1900,
+                calendar.tm_mon + 1, calendar.tm_mday, calendar.tm_hour, calendar.tm_min, calendar.tm_sec,
+                static_cast<int>(microseconds % 1'000'000));
+  return text.data();
+}
+
+}  // namespace appsync
