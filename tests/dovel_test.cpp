@@ -1,9 +1,7 @@
 // Whole runs of the program through its command line, each in a directory of its own.
-#include <dlfcn.h>
 #include <elf.h>
 #include <fcntl.h>
 #include <gtest/gtest.h>
-#include <link.h>
 #include <poll.h>
 #include <pty.h>
 #include <spawn.h>
@@ -17,6 +15,7 @@
 #include <map>
 #include <nlohmann/json.hpp>
 #include <regex>
+#include <stdexcept>
 #include <string>
 #include <vector>
 
@@ -420,25 +419,30 @@ TEST_F(DovelTest, AnInterruptEndsTheSyncInOrderAndTheNextOneSucceeds) {
   EXPECT_EQ(sync(host).status, 0);
 }
 
+// Where a module's file holds what this symbol names.
+std::size_t placeOfSymbol(const std::string& module, const std::string& name) {
+  const auto* header = reinterpret_cast<const Elf64_Ehdr*>(module.data());
+  const auto* sections = reinterpret_cast<const Elf64_Shdr*>(module.data() + header->e_shoff);
+  const auto* segments = reinterpret_cast<const Elf64_Phdr*>(module.data() + header->e_phoff);
+  for (int i = 0; i < header->e_shnum; ++i) {
+    if (sections[i].sh_type != SHT_DYNSYM) continue;
+    const auto* symbols = reinterpret_cast<const Elf64_Sym*>(module.data() + sections[i].sh_offset);
+    const char* names = module.data() + sections[sections[i].sh_link].sh_offset;
+    for (std::size_t k = 0; k < sections[i].sh_size / sizeof(Elf64_Sym); ++k) {
+      if (name != names + symbols[k].st_name) continue;
+      for (int j = 0; j < header->e_phnum; ++j) {
+        const std::size_t inside = symbols[k].st_value - segments[j].p_vaddr;
+        if (segments[j].p_type == PT_LOAD && inside < segments[j].p_filesz) return segments[j].p_offset + inside;
+      }
+    }
+  }
+  throw std::runtime_error("the module does not export " + name);
+}
+
 // A plug-in like the built one, but for its ABI number.
 void writePluginOfAnotherABI(const std::string& path) {
-  const std::string original = std::string(APPSYNC_BIN_DIR) + "/AppSync.so";
-  void* module = ::dlopen(original.c_str(), RTLD_NOW | RTLD_LOCAL);
-  ASSERT_NE(module, nullptr) << ::dlerror();
-  const auto* descriptor = static_cast<const char*>(::dlsym(module, kDovelPluginSymbol));
-  link_map* map = nullptr;
-  ASSERT_EQ(::dlinfo(module, RTLD_DI_LINKMAP, &map), 0);
-  const auto address = static_cast<std::uint64_t>(descriptor - reinterpret_cast<const char*>(map->l_addr));
-  std::string bytes = contentOf(original);
-  const auto* header = reinterpret_cast<const Elf64_Ehdr*>(bytes.data());
-  const auto* segments = reinterpret_cast<const Elf64_Phdr*>(bytes.data() + header->e_phoff);
-  for (int i = 0; i < header->e_phnum; ++i) {
-    const Elf64_Phdr& segment = segments[i];
-    if (segment.p_type != PT_LOAD || address < segment.p_vaddr || address >= segment.p_vaddr + segment.p_filesz)
-      continue;
-    bytes[address - segment.p_vaddr + segment.p_offset + offsetof(DovelPluginDescriptor, abi)] = 99;
-    break;
-  }
+  std::string bytes = contentOf(std::string(APPSYNC_BIN_DIR) + "/AppSync.so");
+  bytes[placeOfSymbol(bytes, kDovelPluginSymbol) + offsetof(DovelPluginDescriptor, abi)] = 99;
   write(path, bytes);
 }
 

@@ -361,8 +361,8 @@ std::string shown(RegistryDevice& device) {
   const auto bytes = device.homeScreen->BrelmGetFlattenedIconState({}, kBrelmIconStateFlattened);
   const auto layout = parsePropertyList(*bytes, nullptr);
   EXPECT_EQ(layout, homeScreenStatus(*device.store));
-  for (const PropertyList& bundleID : layout->elements()) all += (all.empty() ? "" : " ") + *bundleID.string();
-  return all;
+  for (const PropertyList& bundleID : layout->elements()) all.append(*bundleID.string()).append(" ");
+  return all.substr(0, all.rfind(' '));
 }
 
 int push(RegistryDevice& device, const std::string& xml) {
