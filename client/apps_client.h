@@ -38,7 +38,7 @@ class ObserverRelay;
 
 class AppsClient final : public DovelClient {
  public:
-  // --- client/lifecycle.cpp ------------------------------------------------------------------------------------------
+  // --- client/lifecycle.cpp -----------------------------------------------------------------------------------------
 
   // Hosted by the sync daemon itself, the client waits for the daemon's start-up to complete and then registers with
   // the install coordination service, and it ignores installed placeholders from the start; hosted by another process
@@ -60,7 +60,7 @@ class AppsClient final : public DovelClient {
 
   std::string description() const { return "<AppsClient>"; }
 
-  // --- client/sync_working_files.cpp ---------------------------------------------------------------------------------
+  // --- client/sync_working_files.cpp --------------------------------------------------------------------------------
 
   // The array in a property-list file; none when there is no such file, it is empty, or it holds something else. An
   // empty file and a root that is no array leave `error` as it was.
@@ -73,7 +73,7 @@ class AppsClient final : public DovelClient {
 
   void clearSyncData() override;
 
-  // --- client/restore_state_store.cpp --------------------------------------------------------------------------------
+  // --- client/restore_state_store.cpp -------------------------------------------------------------------------------
 
   // What is recorded for an application's version; none when nothing is. Without a version there is nothing.
   std::optional<PropertyList> _restoreStatePropertyForKey(const std::string& key, const std::string& identifier,
@@ -85,12 +85,12 @@ class AppsClient final : public DovelClient {
   void dataMigratorCancelledCoordinatorForRestoreAppBundle(const std::string& bundleID);
   void ostrelDidInstallPlaceHolderForAppBundle(const std::optional<std::string>& bundleID);
 
-  // --- client/installed_assets_report.cpp ----------------------------------------------------------------------------
+  // --- client/installed_assets_report.cpp ---------------------------------------------------------------------------
 
   PropertyList installedAssets() override;
   PropertyList installedAssetMetrics() override;
 
-  // --- client/sync_reconciliation.cpp --------------------------------------------------------------------------------
+  // --- client/sync_reconciliation.cpp -------------------------------------------------------------------------------
 
   bool reconcileSync(std::uint32_t type, const std::string& newAnchor, const ProgressCallback& progressCallback,
                      ErrorOut error) override;
@@ -100,28 +100,28 @@ class AppsClient final : public DovelClient {
   static bool isValidPath(const PropertyList* value);
   static bool isValidPath(const std::optional<std::string>& path);
 
-  // --- client/transfer_phase_end.cpp ---------------------------------------------------------------------------------
+  // --- client/transfer_phase_end.cpp --------------------------------------------------------------------------------
 
   void assetTransferEndedWithSuccess(bool success) override;
 
-  // --- transfer/outstanding_transfers.cpp ----------------------------------------------------------------------------
+  // --- transfer/outstanding_transfers.cpp ---------------------------------------------------------------------------
 
   // Blocks for the query of installs in progress, at most 10 seconds.
   std::vector<DovelAssetRef> outstandingAssetTransfers() override;
 
-  // --- transfer/asset_reception.cpp ----------------------------------------------------------------------------------
+  // --- transfer/asset_reception.cpp ---------------------------------------------------------------------------------
 
   void assetTransferUpdatedProgress(const DovelAssetRef& asset, double progress) override;
   // A failed transfer of a restore ends here: the backup service is told nothing.
   void assetTransferSucceeded(const DovelAssetRef& asset, bool succeeded, const std::optional<Error>& error) override;
 
-  // --- transfer/install_results.cpp ----------------------------------------------------------------------------------
+  // --- transfer/install_results.cpp ---------------------------------------------------------------------------------
 
   void assetInstallSucceeded(const DovelAssetRef& asset) override;
   void assetInstallFailed(const DovelAssetRef& asset, const std::optional<Error>& error) override;
   bool _isRecoverableError(const std::optional<Error>& error);
 
-  // --- coordination/coordinators.cpp ---------------------------------------------------------------------------------
+  // --- coordination/coordinators.cpp --------------------------------------------------------------------------------
 
   // The application's coordinator, when this client made it; `error` is always overwritten with the look-up's.
   OstrelAppInstallCoordinator _initiatingOrUpdatingAppInstallCoordinatorForBundleIdentifier(const std::string& bundleID,
@@ -140,20 +140,20 @@ class AppsClient final : public DovelClient {
       const std::string& bundleID, const std::optional<std::string>& path,
       const OstrelAppInstallCoordinator& coordinatinator);
 
-  // --- coordination/coordinated_install.cpp --------------------------------------------------------------------------
+  // --- coordination/coordinated_install.cpp -------------------------------------------------------------------------
 
   // Whether the application's coordinator is set up and waits for the package.
   bool prepareAppForInstallUsingCoordination(const DovelAssetRef& asset, bool existingApp);
   // Returns at once; the outcome is only logged and recorded.
   void uninstallAppUsingCoordination(const std::string& bundleID);
 
-  // --- coordination/coordinated_transfer.cpp -------------------------------------------------------------------------
+  // --- coordination/coordinated_transfer.cpp ------------------------------------------------------------------------
 
   bool updateTransferProgressForApp(const DovelAssetRef& asset, bool existingApp);
   void transferCompleteForApp(const DovelAssetRef& asset, const std::optional<Error>& error, bool isExistingApp);
   void assetSyncFinishedWithStatus(bool status, const std::set<std::string>& outstandingItems);
 
-  // --- coordination/observer_callbacks.cpp ---------------------------------------------------------------------------
+  // --- coordination/observer_callbacks.cpp --------------------------------------------------------------------------
 
   void coordinatorShouldPrioritize(const OstrelAppInstallCoordinator& coordinator);
   void coordinatorDidInstallPlaceholder(const OstrelAppInstallCoordinator& coordinator);
@@ -163,7 +163,7 @@ class AppsClient final : public DovelClient {
   void promiseDidBeginFulfillmentWithIdentifier(std::uint64_t identifier);
   void applicationInstallsDidCancel(const PellumApplicationProxies& applications);
 
-  // --- restore/placeholder_applications.cpp --------------------------------------------------------------------------
+  // --- restore/placeholder_applications.cpp -------------------------------------------------------------------------
 
   std::string placeholderAppPathForBundleIdentifier(const std::string& bundleID);
   bool createPlaceHolderPath(const std::string& path, const std::string& forBundleIdentifier,
@@ -173,7 +173,7 @@ class AppsClient final : public DovelClient {
   void _enumeratePlaceholdersWithBlock(const PellumApplicationWorkspace::Block& block);
   std::set<std::string> _getSystemAppPlaceholders();
 
-  // --- device/home_screen.cpp ----------------------------------------------------------------------------------------
+  // --- device/home_screen.cpp ---------------------------------------------------------------------------------------
 
   static void _notifyBrelm(NotificationService& notifications, BrelmShell& shell, const ClientLog& log, bool starting);
   static bool _makeIconFromBundlePath(IconServices& icons, FileManager& files, const ClientLog& log,
@@ -229,7 +229,7 @@ class AppsClient final : public DovelClient {
   // coordination/coordinated_transfer.cpp
   OstrelAppInstallCoordinator liveCoordinator(const std::string& bundleID, bool existingApp);
 
-  // --- members -------------------------------------------------------------------------------------------------------
+  // --- members ------------------------------------------------------------------------------------------------------
 
   // Constant after construction.
   const Platform _platform;

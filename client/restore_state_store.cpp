@@ -3,7 +3,7 @@
 
 namespace appsync {
 
-// --- the file: application, version, property ----------------------------------------------------------------------
+// --- the file: application, version, property -----------------------------------------------------------------------
 
 std::optional<PropertyList> AppsClient::readRestoreState(bool& fileIsReadable) {
   const std::optional<Bytes> bytes = _platform.files->readFile(kRestoreStatePath, nullptr);
@@ -40,7 +40,7 @@ void AppsClient::cleanRestoreStateForIdentifier(const std::string& identifier) {
   }
 }
 
-// --- the placeholders that a restore waits for ---------------------------------------------------------------------
+// --- the placeholders that a restore waits for ----------------------------------------------------------------------
 
 void AppsClient::dataMigratorSetPlaceHolderPromiseForRestoreAppBundle(const std::string& bundleID) {
   const OnQueue on(_restoreQueue);

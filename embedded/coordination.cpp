@@ -42,7 +42,7 @@ EmbeddedCoordination::~EmbeddedCoordination() {
   drain();
 }
 
-// --- coordinators ----------------------------------------------------------------------------------------------------
+// --- coordinators ---------------------------------------------------------------------------------------------------
 
 OstrelRef EmbeddedCoordination::coordinatorForApp(OstrelCoordinatorKind kind, const std::string& bundleID,
                                                   OstrelClientID client, bool create, bool* created, ErrorOut error) {
@@ -201,7 +201,7 @@ bool EmbeddedCoordination::setAppAssetPromiseResponsibleClient(OstrelRef coordin
   return true;
 }
 
-// --- placeholders ----------------------------------------------------------------------------------------------------
+// --- placeholders ---------------------------------------------------------------------------------------------------
 
 OstrelRef EmbeddedCoordination::makePlaceholder(const std::string& bundleName, const std::string& bundleID,
                                                 std::uint64_t installType, OstrelClientID /*client*/) {
@@ -252,7 +252,7 @@ bool EmbeddedCoordination::setConfigurationComplete(OstrelRef placeholder, Error
   return open != nullptr;
 }
 
-// --- promises --------------------------------------------------------------------------------------------------------
+// --- promises -------------------------------------------------------------------------------------------------------
 
 OstrelRef EmbeddedCoordination::makePromise(OstrelPromiseKind kind, const std::string& name, OstrelClientID /*client*/,
                                             const std::optional<FileURL>& transferPath,
@@ -286,7 +286,7 @@ bool EmbeddedCoordination::isComplete(OstrelRef promise) {
   return found && found->isComplete;
 }
 
-// --- all of them -----------------------------------------------------------------------------------------------------
+// --- all of them ----------------------------------------------------------------------------------------------------
 
 bool EmbeddedCoordination::cancel(OstrelRef object, const Error& reason, OstrelClientID client, ErrorOut error) {
   MutexLock lock(_mutex);
@@ -338,7 +338,7 @@ void EmbeddedCoordination::release(OstrelRef object) {
   _changed.wait(lock.native(), [&] { return observer->running.size() == own; });
 }
 
-// --- the service itself ----------------------------------------------------------------------------------------------
+// --- the service itself ---------------------------------------------------------------------------------------------
 
 OstrelRef EmbeddedCoordination::addInstallObserver(const std::string& machServiceName,
                                                    const std::set<OstrelClientID>& clients, const Observer& observer) {
@@ -379,7 +379,7 @@ Error EmbeddedCoordination::createUserPresentableError(std::int64_t code, std::i
   return {std::string(kOstrelErrorDomain), code, "The application could not be installed; try again", underlying};
 }
 
-// --- for the device's host -------------------------------------------------------------------------------------------
+// --- for the device's host ------------------------------------------------------------------------------------------
 
 void EmbeddedCoordination::personCancels(const std::string& bundleID, const Error& reason) {
   MutexLock lock(_mutex);
@@ -417,7 +417,7 @@ void EmbeddedCoordination::setInstallGate(std::function<std::optional<Error>(con
   _installGate = std::move(gate);
 }
 
-// --- objects and their holds -----------------------------------------------------------------------------------------
+// --- objects and their holds ----------------------------------------------------------------------------------------
 
 template <typename Object>
 std::shared_ptr<Object> EmbeddedCoordination::find(OstrelRef ref) {

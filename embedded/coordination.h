@@ -77,7 +77,7 @@ class EmbeddedCoordination : public OstrelService {
                        Executor& executor);
   ~EmbeddedCoordination() override;  // drains
 
-  // --- for the device's host; any thread ---------------------------------------------------------------------------
+  // --- for the device's host; any thread ----------------------------------------------------------------------------
 
   // Lets the coordinators work, those of an earlier process too.
   void startWork();
@@ -111,7 +111,7 @@ class EmbeddedCoordination : public OstrelService {
   // Puts coordinators there, in place of those of the same applications: see `seedCoordination`.
   bool seed(const PropertyList& coordinators, ErrorOut error);
 
-  // --- OstrelService -----------------------------------------------------------------------------------------------
+  // --- OstrelService ------------------------------------------------------------------------------------------------
   OstrelRef coordinatorForApp(OstrelCoordinatorKind kind, const std::string& bundleID, OstrelClientID client,
                               bool create, bool* created, ErrorOut error) override;
   OstrelClientID creatorIdentifier(OstrelRef coordinator) override;

@@ -58,7 +58,7 @@ void setIfThere(PropertyList& dictionary, std::string_view key, const std::optio
   if (value) dictionary.set(key, *value);
 }
 
-// --- the parts of a record -------------------------------------------------------------------------------------------
+// --- the parts of a record ------------------------------------------------------------------------------------------
 
 // From the error itself down to the one that caused all.
 PropertyList recordOf(const Error& error) {
@@ -149,7 +149,7 @@ std::optional<PlaceholderDescription> placeholderFrom(const std::optional<Proper
 
 }  // namespace
 
-// --- records ---------------------------------------------------------------------------------------------------------
+// --- records --------------------------------------------------------------------------------------------------------
 
 std::string_view nameOf(OstrelCoordinatorKind kind) {
   for (const auto& [named, name] : kKindNames) {
@@ -237,7 +237,7 @@ void EmbeddedCoordination::loadRecords() {
   }
 }
 
-// --- status ----------------------------------------------------------------------------------------------------------
+// --- status ---------------------------------------------------------------------------------------------------------
 
 namespace {
 
@@ -272,7 +272,7 @@ PropertyList coordinationStatus(const StateStore& store) {
   return entries;
 }
 
-// --- seed ------------------------------------------------------------------------------------------------------------
+// --- seed -----------------------------------------------------------------------------------------------------------
 
 namespace {
 

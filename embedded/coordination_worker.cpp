@@ -73,7 +73,7 @@ EmbeddedCoordination::Step EmbeddedCoordination::nextStep(const InstallCoordinat
   return Step::None;
 }
 
-// --- setting it to work ----------------------------------------------------------------------------------------------
+// --- setting it to work ---------------------------------------------------------------------------------------------
 
 void EmbeddedCoordination::startWork() {
   MutexLock lock(_mutex);
@@ -136,7 +136,7 @@ void EmbeddedCoordination::work(const std::shared_ptr<InstallCoordinator>& coord
   }
 }
 
-// --- the steps -------------------------------------------------------------------------------------------------------
+// --- the steps ------------------------------------------------------------------------------------------------------
 
 // A record that cannot be written is tried again with the next change: the coordinator works on without it, and a later
 // process finds the older state.
@@ -287,7 +287,7 @@ void EmbeddedCoordination::deletePackage(const std::shared_ptr<InstallCoordinato
   if (attributes && !attributes->isDirectory) _files.removeItem(path, nullptr);
 }
 
-// --- telling ---------------------------------------------------------------------------------------------------------
+// --- telling --------------------------------------------------------------------------------------------------------
 
 void EmbeddedCoordination::tellEnding(const std::shared_ptr<InstallCoordinator>& coordinator) {
   InstallCoordinator::Ending ending;
@@ -368,7 +368,7 @@ void EmbeddedCoordination::tellHost(const CoordinatorEvent& event) {
   if (listener) listener(event);
 }
 
-// --- removing --------------------------------------------------------------------------------------------------------
+// --- removing -------------------------------------------------------------------------------------------------------
 
 void EmbeddedCoordination::remove(const std::string& bundleID, const Completion& completion) {
   std::optional<Error> problem;
@@ -395,7 +395,7 @@ void EmbeddedCoordination::forgetRecord(const std::string& bundleID) {
   _store.remove(coordinatorRecordName(bundleID), nullptr);
 }
 
-// --- coming to rest --------------------------------------------------------------------------------------------------
+// --- coming to rest -------------------------------------------------------------------------------------------------
 
 bool EmbeddedCoordination::isSettled() const {
   if (_jobs > 0) return false;

@@ -28,7 +28,7 @@ class EmbeddedDeviceService : public DovelDeviceService {
   // Completions run on `executor`, which must outlive the service.
   explicit EmbeddedDeviceService(Executor& executor) : _executor(executor) {}
 
-  // --- the client's side ------------------------------------------------------------------------------------------
+  // --- the client's side --------------------------------------------------------------------------------------------
 
   bool offers(Operation) override { return true; }
   // Ahead of everything that waits; a transfer in flight goes on, and counts as ahead already.

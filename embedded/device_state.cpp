@@ -22,8 +22,7 @@ constexpr char kTodoList[] = "/var/mobile/Library/ApplicationSync/TarvoStuff/App
 constexpr char kRestoreState[] = "/var/mobile/Library/ApplicationSync/RestoreState.plist";
 constexpr char kLastSyncList[] = "/var/mobile/Library/ApplicationSync/LastSyncAppState.plist";
 
-// --- telling
-// -----------------------------------------------------------------------------------------------------------
+// --- telling --------------------------------------------------------------------------------------------------------
 
 std::optional<PropertyList> readPropertyList(EmbeddedFileManager& files, const char* path) {
   const std::optional<Bytes> bytes = files.readFile(path, nullptr);
@@ -93,8 +92,7 @@ std::optional<PropertyList> Device::status(const std::string& directory, ErrorOu
   return status;
 }
 
-// --- putting there
-// -----------------------------------------------------------------------------------------------------
+// --- putting there --------------------------------------------------------------------------------------------------
 
 namespace {
 

@@ -77,8 +77,7 @@ bool writeAll(Disk& disk, int file, const void* bytes, std::size_t size) {
   return true;
 }
 
-// --- temporary files
-// ---------------------------------------------------------------------------------------------------
+// --- temporary files ------------------------------------------------------------------------------------------------
 
 namespace {
 
@@ -119,8 +118,7 @@ bool isTemporaryName(const std::string& name) {
          name.find_first_not_of(kDigits, kTemporaryPrefix.size()) == std::string::npos;
 }
 
-// --- directories
-// -------------------------------------------------------------------------------------------------------
+// --- directories ----------------------------------------------------------------------------------------------------
 
 bool listDirectory(int directory, std::vector<std::string>& names) {
   names.clear();
@@ -150,7 +148,9 @@ namespace {
 // costs memory for names only.
 class TreeWalk {
  public:
-  TreeWalk(Disk& disk, const std::function<int(const TreeEntry&)>& visit) : _disk(disk), _visit(visit) {}
+  TreeWalk(Disk& disk, const std::function<int(const TreeEntry&)>& visit,
+           const std::function<bool(const std::string& name)>& enters)
+      : _disk(disk), _visit(visit), _enters(enters) {}
 
   int run(int directory) {
     if (!descend(openDirectoryAt(_disk, directory, "."), {}, {})) note(errno);
@@ -180,6 +180,8 @@ class TreeWalk {
       if (errno != ENOENT) note(errno);
     } else if (!S_ISDIR(status.st_mode)) {
       note(_visit({_current.get(), name, status}));
+    } else if (_enters && !_enters(name)) {
+      return;
     } else if (!descend(openDirectoryAt(_disk, _current.get(), name), name, status)) {
       note(errno);
       note(_visit({_current.get(), name, status}));
@@ -220,6 +222,7 @@ class TreeWalk {
 
   Disk& _disk;
   const std::function<int(const TreeEntry&)>& _visit;
+  const std::function<bool(const std::string& name)>& _enters;
   OwnedFile _current;
   std::vector<Level> _levels;
   int _firstError = 0;
@@ -227,8 +230,9 @@ class TreeWalk {
 
 }  // namespace
 
-int walkTree(Disk& disk, int directory, const std::function<int(const TreeEntry&)>& visit) {
-  return TreeWalk(disk, visit).run(directory);
+int walkTree(Disk& disk, int directory, const std::function<int(const TreeEntry&)>& visit,
+             const std::function<bool(const std::string& name)>& enters) {
+  return TreeWalk(disk, visit, enters).run(directory);
 }
 
 }  // namespace appsync

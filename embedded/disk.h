@@ -79,7 +79,9 @@ struct TreeEntry {
 
 // Visits everything below a directory, what a directory holds before the directory itself. Follows no link, and takes a
 // tree of any depth: it holds no more than three handles at a time. `visit` answers 0 or an error number; the walk goes
-// on after an error. Answers 0 or the first error number, of a visit or of a directory that could not be read.
-int walkTree(Disk& disk, int directory, const std::function<int(const TreeEntry&)>& visit);
+// on after an error. A directory whose name `enters` answers false for is passed over whole. Answers 0 or the first error
+// number, of a visit or of a directory that could not be read.
+int walkTree(Disk& disk, int directory, const std::function<int(const TreeEntry&)>& visit,
+             const std::function<bool(const std::string& name)>& enters = {});
 
 }  // namespace appsync

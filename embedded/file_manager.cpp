@@ -125,8 +125,7 @@ Error fileError(const std::string& operation, const std::string& path, int error
       "Cannot " + operation + " \"" + path + "\": " + textOfErrorNumber(errorNumber) + whatWouldMend(errorNumber));
 }
 
-// --- a file in pieces
-// --------------------------------------------------------------------------------------------------
+// --- a file in pieces -----------------------------------------------------------------------------------------------
 
 FileSink::FileSink(Disk& disk, std::string path, OwnedFile directory, std::string name, OwnedFile file,
                    std::string temporary)
@@ -161,8 +160,7 @@ bool FileSink::fail(int errorNumber, ErrorOut error) {
   return false;
 }
 
-// --- walking to a path
-// -------------------------------------------------------------------------------------------------
+// --- walking to a path ----------------------------------------------------------------------------------------------
 
 struct EmbeddedFileManager::Place {
   OwnedFile directory;
@@ -225,8 +223,7 @@ Error EmbeddedFileManager::error(const std::string& operation, const std::string
   return fileError(operation, _namesOwnFiles ? hostPath(path) : path, errorNumber);
 }
 
-// --- reading
-// -----------------------------------------------------------------------------------------------------------
+// --- reading --------------------------------------------------------------------------------------------------------
 
 std::string EmbeddedFileManager::temporaryDirectory() {
   return "/var/mobile/tmp";
@@ -320,8 +317,7 @@ std::string EmbeddedFileManager::strerror(int errorNumber) {
   return textOfErrorNumber(errorNumber);
 }
 
-// --- writing
-// -----------------------------------------------------------------------------------------------------------
+// --- writing --------------------------------------------------------------------------------------------------------
 
 bool EmbeddedFileManager::writeFile(const std::string& path, const Bytes& bytes, ErrorOut error) {
   const int result =
@@ -480,16 +476,22 @@ bool EmbeddedFileManager::flushTree(const std::string& path, ErrorOut error) con
   return result == 0;
 }
 
+// What lies in an application's bundle is the application's own, whatever it is called.
 std::size_t EmbeddedFileManager::removeLeftTemporaryFiles() const {
-  const OwnedFile root(_disk.openat(AT_FDCWD, _root.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC, 0));
+  constexpr std::string_view kContainers = "Containers";
   std::size_t removed = 0;
-  if (!root) return removed;
-  walkTree(_disk, root.get(), [&](const TreeEntry& entry) {
+  const auto remove = [&](const TreeEntry& entry) {
     if (!S_ISREG(entry.status.st_mode) || !isTemporaryName(entry.name)) return 0;
     if (_disk.unlinkat(entry.directory, entry.name.c_str(), 0) != 0) return errno;
     ++removed;
     return 0;
-  });
+  };
+  const OwnedFile root(_disk.openat(AT_FDCWD, _root.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC, 0));
+  if (!root) return removed;
+  walkTree(_disk, root.get(), remove, [&](const std::string& name) { return name != kContainers; });
+  const OwnedFile containers = openDirectory("/var/mobile/Containers", nullptr);
+  if (!containers) return removed;
+  walkTree(_disk, containers.get(), remove, [](const std::string& name) { return !name.ends_with(".app"); });
   return removed;
 }
 

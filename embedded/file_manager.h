@@ -68,7 +68,7 @@ class EmbeddedFileManager : public FileManager {
   int utimes(const std::string& path) override;
   std::string strerror(int errorNumber) override;
 
-  // --- for the services of the embedded device and its host ------------------------------------------------------
+  // --- for the services of the embedded device and its host ---------------------------------------------------------
 
   // Where the path lies on the machine; for messages, and for programs that only read.
   std::string hostPath(const std::string& path) const;

@@ -19,7 +19,7 @@ constexpr std::size_t kMostIconFiles = 64;           // looked at in one bundle
 constexpr double kCornerRadius = 0.225;              // of the icon's side
 constexpr std::size_t kChannels = 4;
 
-// --- PNG files -----------------------------------------------------------------------------------
+// --- PNG files ------------------------------------------------------------------------------------------------------
 
 // The library's reader and writer of whole images, which reports its errors by results.
 class PNGImage {
@@ -76,7 +76,7 @@ class PNGDestination : public ImageDestination {
   std::size_t _images = 0;
 };
 
-// --- scaling -------------------------------------------------------------------------------------
+// --- scaling --------------------------------------------------------------------------------------------------------
 
 // Pixels with colours multiplied by their opacity, so that what is transparent lends no colour to its neighbours.
 struct Surface {

@@ -13,8 +13,7 @@ constexpr std::uint32_t kBadName = 1;
 
 }  // namespace
 
-// --- the center
-// --------------------------------------------------------------------------------------------------------
+// --- the center -----------------------------------------------------------------------------------------------------
 
 struct EmbeddedNotificationCenter::Registration {
   const std::shared_ptr<void> observer;
@@ -66,8 +65,7 @@ void EmbeddedNotificationCenter::deliver(const std::shared_ptr<Registration>& re
   _callbackEnded.notify_all();
 }
 
-// --- states
-// ------------------------------------------------------------------------------------------------------------
+// --- states ---------------------------------------------------------------------------------------------------------
 
 std::uint32_t EmbeddedNotificationService::registerCheck(const std::string& name, int& token) {
   if (name.empty()) return kBadName;

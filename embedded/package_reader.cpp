@@ -14,6 +14,8 @@
 #include <utility>
 #include <vector>
 
+#include "platform/utf8.h"
+
 namespace appsync {
 
 namespace {
@@ -24,41 +26,14 @@ constexpr std::size_t kBlockSize = 256 << 10;
 constexpr std::size_t kNameLength = 255;  // of one component, as file systems have it
 constexpr std::size_t kLinkTargetLength = 1024;
 
-// --- texts ---------------------------------------------------------------------------------------
-
-// Length of the UTF-8 sequence at the start of the text; 0 when there is none.
-std::size_t sequenceLength(std::string_view text) {
-  const auto byte = [&](std::size_t at) { return static_cast<unsigned char>(text[at]); };
-  const unsigned char first = byte(0);
-  if (first < 0x80) return 1;
-  const std::size_t length = first >= 0xC2 && first < 0xE0   ? 2
-                             : first >= 0xE0 && first < 0xF0 ? 3
-                             : first >= 0xF0 && first < 0xF5 ? 4
-                                                             : 0;
-  if (length == 0 || text.size() < length) return 0;
-  for (std::size_t at = 1; at < length; ++at) {
-    if ((byte(at) & 0xC0) != 0x80) return 0;
-  }
-  const bool overlong = (first == 0xE0 && byte(1) < 0xA0) || (first == 0xF0 && byte(1) < 0x90);
-  const bool outside = (first == 0xED && byte(1) >= 0xA0) || (first == 0xF4 && byte(1) >= 0x90);
-  return overlong || outside ? 0 : length;
-}
-
-bool isUTF8(std::string_view text) {
-  while (!text.empty()) {
-    const std::size_t length = sequenceLength(text);
-    if (length == 0) return false;
-    text.remove_prefix(length);
-  }
-  return true;
-}
+// --- texts ----------------------------------------------------------------------------------------------------------
 
 // A name out of a package as a message can show it.
 std::string quoted(std::string_view text) {
   constexpr std::size_t kShown = 160;
   std::string shown = "\"";
   while (!text.empty() && shown.size() < kShown) {
-    const std::size_t length = sequenceLength(text);
+    const std::size_t length = utf8CharacterLength(text);
     const bool plain = length > 1 || (length == 1 && text[0] >= ' ' && text[0] != 0x7F);
     shown += plain ? text.substr(0, length) : "?";
     text.remove_prefix(std::max<std::size_t>(length, 1));
@@ -102,7 +77,7 @@ class Failure {
   ErrorOut _error;
 };
 
-// --- the archive's own directory -----------------------------------------------------------------
+// --- the archive's own directory ------------------------------------------------------------------------------------
 
 // Checks the structure of the archive before anything of it is unpacked: that nothing is cut off or put before or
 // behind it, that its directory says how many entries there are and holds that many, that each entry's own header
@@ -301,7 +276,7 @@ class ArchiveCheck {
   std::uint64_t _unpackedSize = 0;
 };
 
-// --- names ---------------------------------------------------------------------------------------
+// --- names ----------------------------------------------------------------------------------------------------------
 
 bool isPlainComponent(std::string_view name) {
   return !name.empty() && name != "." && name != ".." && name.size() <= kNameLength;
@@ -343,7 +318,7 @@ bool linkStaysInside(std::string_view target, std::size_t depth) {
   return true;
 }
 
-// --- the entries ---------------------------------------------------------------------------------
+// --- the entries ----------------------------------------------------------------------------------------------------
 
 struct ArchiveDeleter {
   void operator()(archive* handle) const { ::archive_read_free(handle); }

@@ -88,10 +88,10 @@ EmbeddedRegistry::EmbeddedRegistry(StateStore& store, EmbeddedFileManager& files
     _nextSerial = last + 1;
   }
   finishInterruptedInstalls();
-  if (!unreadable) sweepContainers();
+  sweepContainers(unreadable || store.hasSetAside("applications") || store.hasSetAside("placeholders"));
 }
 
-// --- looking -------------------------------------------------------------------------------------
+// --- looking --------------------------------------------------------------------------------------------------------
 
 bool EmbeddedRegistry::applicationIsInstalled(const std::string& bundleID) {
   const MutexLock lock(_mutex);
@@ -131,7 +131,7 @@ std::vector<std::string> EmbeddedRegistry::identifiersByArrival() {
   return appsync::identifiersByArrival(_applications, _placeholders);
 }
 
-// --- changing ------------------------------------------------------------------------------------
+// --- changing -------------------------------------------------------------------------------------------------------
 
 bool EmbeddedRegistry::installPlaceholder(const PlaceholderDescription& description, ErrorOut error) {
   const std::string& bundleID = description.bundleID;
@@ -293,7 +293,7 @@ std::uint64_t EmbeddedRegistry::arrivalOf(const std::string& bundleID) {
   return _nextSerial.fetch_add(1);
 }
 
-// --- containers ----------------------------------------------------------------------------------
+// --- containers -----------------------------------------------------------------------------------------------------
 
 std::string EmbeddedRegistry::newContainerName() {
   return std::to_string(_nextSerial.fetch_add(1));
@@ -334,7 +334,9 @@ void EmbeddedRegistry::finishInterruptedInstalls() {
   for (const std::string& bundleID : ended) removePlaceholder(bundleID, nullptr);
 }
 
-void EmbeddedRegistry::sweepContainers() {
+// With `keepWhole` only what was never finished goes: a container that no record names can be that of an application
+// whose record has been damaged.
+void EmbeddedRegistry::sweepContainers(bool keepWhole) {
   std::set<std::string> applications{lastComponent(kPlaceholdersDirectory)};
   std::set<std::string> placeholders;
   {
@@ -344,19 +346,20 @@ void EmbeddedRegistry::sweepContainers() {
     }
     for (const auto& [bundleID, record] : _placeholders) placeholders.insert(lastComponent(record.containerPath));
   }
-  sweepDirectory(kContainersDirectory, applications);
-  sweepDirectory(kPlaceholdersDirectory, placeholders);
+  sweepDirectory(kContainersDirectory, applications, keepWhole);
+  sweepDirectory(kPlaceholdersDirectory, placeholders, keepWhole);
 }
 
-void EmbeddedRegistry::sweepDirectory(const std::string& directory, const std::set<std::string>& kept) {
+void EmbeddedRegistry::sweepDirectory(const std::string& directory, const std::set<std::string>& named,
+                                      bool keepWhole) {
   for (const std::string& name : _files.contentsOfDirectory(directory, nullptr).value_or(std::vector<std::string>())) {
-    if (kept.contains(name)) continue;
-    removeContainer(std::string(directory).append("/").append(name));
-    _nextSerial = std::max(_nextSerial.load(), serialOf(name) + 1);  // in case it could not be removed
+    if (named.contains(name)) continue;
+    if (!keepWhole || name.starts_with('.')) removeContainer(std::string(directory).append("/").append(name));
+    _nextSerial = std::max(_nextSerial.load(), serialOf(name) + 1);  // in case it is still there
   }
 }
 
-// --- installs under way --------------------------------------------------------------------------
+// --- installs under way ---------------------------------------------------------------------------------------------
 
 void EmbeddedRegistry::addObserver(const Observer& observer) {
   _observers.add(observer);

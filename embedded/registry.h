@@ -63,7 +63,7 @@ struct InstallDisplay {
 class EmbeddedRegistry : public PellumApplicationWorkspace {
  public:
   // Loads the records, finishes an install whose last step a crash prevented, and sweeps away containers that no record
-  // names. A record that cannot be read is left out, and then nothing is swept. The executor must have been drained
+  // names. A record that cannot be read is left out, and then only unfinished ones are. The executor must be drained
   // when this is destroyed.
   EmbeddedRegistry(StateStore& store, EmbeddedFileManager& files, Executor& executor);
 
@@ -122,8 +122,8 @@ class EmbeddedRegistry : public PellumApplicationWorkspace {
   std::uint64_t arrivalOf(const std::string& bundleID);
 
   void finishInterruptedInstalls();
-  void sweepContainers();
-  void sweepDirectory(const std::string& directory, const std::set<std::string>& kept);
+  void sweepContainers(bool keepWhole);
+  void sweepDirectory(const std::string& directory, const std::set<std::string>& named, bool keepWhole);
   void removeContainer(const std::string& path);
 
   // How an install is reported; an install that is not live is in no list.
@@ -156,7 +156,7 @@ class EmbeddedRegistry : public PellumApplicationWorkspace {
   std::map<std::string, InstallDisplay> _displays APPSYNC_GUARDED_BY(_mutex);
 };
 
-// --- status and seed -----------------------------------------------------------------------------
+// --- status and seed ------------------------------------------------------------------------------------------------
 
 // "installed" of a device's status: an array of {"identifier", "version", "name", "type", "size", "container" (relative
 // to the device's directory), and what a seed said of an install}, sorted by identifier; a version that is absent has

@@ -11,7 +11,7 @@ namespace {
 constexpr char kApplications[] = "applications";
 constexpr char kPlaceholders[] = "placeholders";
 
-// --- reading and writing the fields of a record; an absent one has no key ------------------------
+// --- reading and writing the fields of a record; an absent one has no key -------------------------------------------
 
 std::string text(const PropertyList& record, std::string_view key) {
   const PropertyList* value = record.find(key);

@@ -15,7 +15,7 @@ namespace {
 
 constexpr std::uint64_t kLargestFile = 1ULL << 40;
 
-// --- status --------------------------------------------------------------------------------------
+// --- status ---------------------------------------------------------------------------------------------------------
 
 void copyInstall(const std::optional<SeededInstall>& seeded, PropertyList& entry) {
   if (!seeded) return;
@@ -25,7 +25,7 @@ void copyInstall(const std::optional<SeededInstall>& seeded, PropertyList& entry
   if (!seeded->progress) entry.set("progress", false);
 }
 
-// --- checks --------------------------------------------------------------------------------------
+// --- checks ---------------------------------------------------------------------------------------------------------
 
 enum class Wanted : std::uint8_t { Text, Number, Size, Flag, Dictionary, ApplicationType, FileSizes };
 
@@ -127,7 +127,7 @@ bool checkEntries(const std::string& list, const PropertyList& entries, const st
   return true;
 }
 
-// --- entries -------------------------------------------------------------------------------------
+// --- entries --------------------------------------------------------------------------------------------------------
 
 std::optional<std::string> text(const PropertyList& entry, std::string_view key) {
   const PropertyList* value = entry.find(key);

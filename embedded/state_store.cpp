@@ -6,6 +6,7 @@
 #include <utility>
 
 #include "embedded/file_manager.h"
+#include "platform/utf8.h"
 
 namespace appsync {
 
@@ -87,6 +88,12 @@ class FileStateStore : public StateStore {
     return keys;
   }
 
+  bool hasSetAside(const std::string& collection) const override {
+    if (!isSinglePathComponent(collection)) return false;
+    const auto names = _files.contentsOfDirectory(std::string(kStateDirectory) + "/" + collection, nullptr);
+    return names && std::ranges::any_of(*names, [](const auto& name) { return name.ends_with(kDamagedSuffix); });
+  }
+
  private:
   mutable EmbeddedFileManager _files;  // reading changes nothing in it
 };
@@ -118,23 +125,6 @@ bool repairRecordsIn(EmbeddedFileManager& files, const std::string& directory, i
   return true;
 }
 
-// The length of the UTF-8 sequence at the start of the text; 0 when there is none that is valid.
-std::size_t validSequence(std::string_view text) {
-  const auto byte = [&](std::size_t at) { return static_cast<unsigned char>(text[at]); };
-  const unsigned first = byte(0);
-  if (first < 0x80) return 1;
-  const std::size_t length = first >= 0xF0 ? 4 : first >= 0xE0 ? 3 : 2;
-  if (first < 0xC2 || first > 0xF4 || text.size() < length) return 0;
-  for (std::size_t i = 1; i < length; ++i) {
-    if ((byte(i) & 0xC0U) != 0x80) return 0;
-  }
-  // Overlong forms, surrogates, and what is beyond the last character.
-  const unsigned second = byte(1);
-  if ((first == 0xE0 && second < 0xA0) || (first == 0xED && second > 0x9F)) return 0;
-  if ((first == 0xF0 && second < 0x90) || (first == 0xF4 && second > 0x8F)) return 0;
-  return length;
-}
-
 }  // namespace
 
 std::unique_ptr<StateStore> makeFileStateStore(EmbeddedFileManager& files) {
@@ -150,12 +140,7 @@ bool isSinglePathComponent(const std::string& text) {
   constexpr std::size_t kLongest = 200;
   if (text.empty() || text == "." || text == ".." || text.size() > kLongest) return false;
   if (text.find('/') != std::string::npos || text.find('\0') != std::string::npos) return false;
-  for (std::size_t at = 0; at < text.size();) {
-    const std::size_t length = validSequence(std::string_view(text).substr(at));
-    if (length == 0) return false;
-    at += length;
-  }
-  return true;
+  return isUTF8(text);
 }
 
 }  // namespace appsync

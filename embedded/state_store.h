@@ -28,6 +28,8 @@ class StateStore {
   virtual bool remove(const std::string& name, ErrorOut error) = 0;
   // The keys of a collection, sorted.
   virtual std::vector<std::string> keys(const std::string& collection) const = 0;
+  // Whether a record of the collection was found damaged, now or earlier, and has been moved aside.
+  virtual bool hasSetAside(const std::string& collection) const = 0;
 };
 
 // Records as binary property lists at DIR/state/NAME.plist of the device whose files these are; directories are made

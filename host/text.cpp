@@ -6,6 +6,8 @@
 #include <cstdio>
 #include <iterator>
 
+#include "platform/utf8.h"
+
 namespace appsync {
 
 namespace {
@@ -67,28 +69,10 @@ bool isObeyed(char32_t character) {
 
 // Takes one character off the front of `rest`; false, with one byte taken, when it is no UTF-8.
 bool takeCharacter(std::string_view& rest, char32_t& character) {
-  const auto byteAt = [&](std::size_t at) { return static_cast<unsigned char>(rest[at]); };
-  const unsigned char first = byteAt(0);
-  const std::size_t size = first < 0x80   ? 1
-                           : first < 0xC2 ? 0
-                           : first < 0xE0 ? 2
-                           : first < 0xF0 ? 3
-                           : first < 0xF5 ? 4
-                                          : 0;
-  bool valid = size != 0 && size <= rest.size();
-  if (valid) {
-    constexpr std::array<unsigned, 5> kFirstBits{0, 0x7F, 0x1F, 0x0F, 0x07};
-    character = first & kFirstBits[size];
-    for (std::size_t i = 1; i < size && valid; ++i) {
-      valid = (byteAt(i) & 0xC0U) == 0x80;
-      character = (character << 6U) | (byteAt(i) & 0x3FU);
-    }
-    constexpr std::array<char32_t, 5> kSmallest{0, 0, 0x80, 0x800, 0x10000};
-    valid =
-        valid && character >= kSmallest[size] && character <= 0x10FFFF && (character < 0xD800 || character > 0xDFFF);
-  }
-  rest.remove_prefix(valid ? size : 1);
-  return valid;
+  const std::size_t length = utf8CharacterLength(rest);
+  if (length > 0) character = utf8Character(rest, length);
+  rest.remove_prefix(length > 0 ? length : 1);
+  return length > 0;
 }
 
 std::size_t widthOf(char32_t character) {

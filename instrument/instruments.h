@@ -47,7 +47,7 @@ class Instruments {
   // The wrapped services, with the bare platform's main bundle identifier. Valid as long as the instruments.
   Platform platform();
 
-  // --- faults ------------------------------------------------------------------------------------------------------
+  // --- faults -------------------------------------------------------------------------------------------------------
 
   // What a fault can be made for, with each one's way of failing.
   static std::span<const OperationInfo> operations() { return faultableOperations(); }
@@ -68,11 +68,11 @@ class Instruments {
   // operation. Valid as long as the instruments.
   FaultQuery faultQuery();
 
-  // --- recording ---------------------------------------------------------------------------------------------------
+  // --- recording ----------------------------------------------------------------------------------------------------
 
   Recorder& recorder();
 
-  // --- answers and events ------------------------------------------------------------------------------------------
+  // --- answers and events -------------------------------------------------------------------------------------------
 
   // Replaces the script, for calls that begin from now on.
   void setAnswers(ScriptedAnswers answers);

@@ -20,7 +20,7 @@ Error phantomRefuses(std::string_view operation) {
 
 }  // namespace
 
-// --- calls on objects ------------------------------------------------------------------------------------------------
+// --- calls on objects -----------------------------------------------------------------------------------------------
 
 template <class Forward, class... Shown>
 std::invoke_result_t<Forward, ErrorOut> WrappedCoordination::on(OstrelRef object, Operation operation, ErrorOut error,
@@ -59,7 +59,7 @@ void WrappedCoordination::tell(OstrelRef object, Operation operation, const Forw
   _probe.tell(operation, Subject::application(application), unlessPhantom, named(object), shown...);
 }
 
-// --- coordinators ----------------------------------------------------------------------------------------------------
+// --- coordinators ---------------------------------------------------------------------------------------------------
 
 OstrelRef WrappedCoordination::coordinatorForApp(OstrelCoordinatorKind kind, const std::string& bundleID,
                                                  OstrelClientID client, bool create, bool* created, ErrorOut error) {
@@ -172,7 +172,7 @@ bool WrappedCoordination::setAppAssetPromiseResponsibleClient(OstrelRef coordina
   return on(coordinator, "setAppAssetPromiseResponsibleClient", error, forward, field("client", client));
 }
 
-// --- placeholders ----------------------------------------------------------------------------------------------------
+// --- placeholders ---------------------------------------------------------------------------------------------------
 
 OstrelRef WrappedCoordination::makePlaceholder(const std::string& bundleName, const std::string& bundleID,
                                                std::uint64_t installType, OstrelClientID client) {
@@ -208,7 +208,7 @@ bool WrappedCoordination::setConfigurationComplete(OstrelRef placeholder, ErrorO
   return on(placeholder, "setConfigurationCompleteWithError", error, forward);
 }
 
-// --- promises --------------------------------------------------------------------------------------------------------
+// --- promises -------------------------------------------------------------------------------------------------------
 
 OstrelRef WrappedCoordination::makePromise(OstrelPromiseKind kind, const std::string& name, OstrelClientID client,
                                            const std::optional<FileURL>& transferPath, std::uint64_t diskSpaceNeeded) {
@@ -247,7 +247,7 @@ bool WrappedCoordination::isComplete(OstrelRef promise) {
       name.substr(open, name.size() - open - 1));
 }
 
-// --- all of them, and the service itself -----------------------------------------------------------------------------
+// --- all of them, and the service itself ----------------------------------------------------------------------------
 
 bool WrappedCoordination::cancel(OstrelRef object, const Error& reason, OstrelClientID client, ErrorOut error) {
   const auto forward = [&](ErrorOut out) { return _bare.cancel(object, reason, client, out); };
@@ -286,7 +286,7 @@ Error WrappedCoordination::createUserPresentableError(std::int64_t code, std::in
                       field("flag", flag), underlying);
 }
 
-// --- observers -------------------------------------------------------------------------------------------------------
+// --- observers ------------------------------------------------------------------------------------------------------
 
 // Stands between the service and one observer. The handles that it passes on are the wrapper's, so that calls on them
 // go the same way as all others.

@@ -19,8 +19,7 @@
 
 namespace appsync {
 
-// --- descriptions
-// ------------------------------------------------------------------------------------------------------
+// --- descriptions ---------------------------------------------------------------------------------------------------
 
 template <class T>
 concept HasDescription = requires(const T& value) {
@@ -78,8 +77,7 @@ std::string describe(const std::set<T>& values) {
   return log_detail::describeAll(values);
 }
 
-// --- arguments
-// ---------------------------------------------------------------------------------------------------------
+// --- arguments ------------------------------------------------------------------------------------------------------
 
 enum class LogArgumentKind : std::uint8_t { Signed, Unsigned, Character, Fraction, Text, Object };
 

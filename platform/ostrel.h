@@ -92,7 +92,7 @@ class OstrelService {
 
   virtual ~OstrelService() = default;
 
-  // --- coordinators ------------------------------------------------------------------------------------------------
+  // --- coordinators -------------------------------------------------------------------------------------------------
 
   // The coordinator of that kind for the application. A look-up (`create` false) may find a dead one, whose `error` is
   // set; with `create` a dead one is replaced. None, with an error, when there is none and none may be made, when one
@@ -129,11 +129,12 @@ class OstrelService {
   virtual bool setPlaceholderPromise(OstrelRef coordinator, OstrelRef placeholder, ErrorOut error) = 0;
   virtual bool hasUserDataPromise(OstrelRef coordinator) = 0;
   virtual bool setUserDataPromise(OstrelRef coordinator, OstrelRef promise, ErrorOut error) = 0;
-  // Who delivers the package; 0 when nobody has been named. Restoring coordinators only: others answer 0 and refuse.
+  // Who delivers the package; 0 when nobody has been named. Restoring coordinators only: others answer 0 and refuse. May
+  // be named anew while the coordinator lives.
   virtual OstrelClientID appAssetPromiseResponsibleClient(OstrelRef coordinator, ErrorOut error) = 0;
   virtual bool setAppAssetPromiseResponsibleClient(OstrelRef coordinator, OstrelClientID client, ErrorOut error) = 0;
 
-  // --- placeholders ------------------------------------------------------------------------------------------------
+  // --- placeholders -------------------------------------------------------------------------------------------------
 
   // None for an identifier that is no single path component.
   virtual OstrelRef makePlaceholder(const std::string& bundleName, const std::string& bundleID,
@@ -144,7 +145,7 @@ class OstrelService {
   virtual bool setMetadata(OstrelRef placeholder, const std::optional<KilnStoreMetadata>& metadata, ErrorOut error) = 0;
   virtual bool setConfigurationComplete(OstrelRef placeholder, ErrorOut error) = 0;
 
-  // --- promises ----------------------------------------------------------------------------------------------------
+  // --- promises -----------------------------------------------------------------------------------------------------
 
   // `transferPath` is absent for data whose place is named later, or that travels out of band.
   virtual OstrelRef makePromise(OstrelPromiseKind kind, const std::string& name, OstrelClientID client,
@@ -154,7 +155,7 @@ class OstrelService {
   virtual void setComplete(OstrelRef promise, bool complete) = 0;
   virtual bool isComplete(OstrelRef promise) = 0;
 
-  // --- all of them -------------------------------------------------------------------------------------------------
+  // --- all of them --------------------------------------------------------------------------------------------------
 
   // Cancels a coordinator, placeholder or promise. A coordinator's cancellation is reported to its observers with the
   // client named here, also when that client did it itself. False, with an error, for what is dead or done already.
@@ -167,7 +168,7 @@ class OstrelService {
   // placeholder begins its work. Never fails; a reference of 0 is ignored.
   virtual void release(OstrelRef object) = 0;
 
-  // --- the service itself --------------------------------------------------------------------------------------------
+  // --- the service itself -------------------------------------------------------------------------------------------
 
   // Registers for the events of coordinators that one of `clients` created and that have no observer of their own,
   // until the reference is released; release returns when no callback runs any more, except one that it is called from.

@@ -32,7 +32,7 @@ void require(bool condition, const char* what) {
   std::abort();
 }
 
-// --- nodes -----------------------------------------------------------------------------------------------------------
+// --- nodes ----------------------------------------------------------------------------------------------------------
 
 Bits newScalarNode(std::uint64_t payload, Internals::Tag tag) {
   return Internals::tagged(new ScalarNode{1, payload}, tag);
@@ -79,8 +79,7 @@ void ownArray(PropertyList& array, std::size_t wanted) {
   array = std::move(fresh);
 }
 
-// --- the index of a dictionary
-// -----------------------------------------------------------------------------------------
+// --- the index of a dictionary --------------------------------------------------------------------------------------
 
 constexpr std::uint32_t kMostScanned = 8;
 constexpr std::uint32_t kMostByteIndexed = 254;
@@ -164,8 +163,7 @@ std::uint32_t locate(Bits dictionary, std::string_view key) {
   return locate(dictionary, hashed);
 }
 
-// --- the members of a dictionary
-// ---------------------------------------------------------------------------------------
+// --- the members of a dictionary ------------------------------------------------------------------------------------
 
 Bits newDictionaryNode(std::size_t wanted) {
   if (wanted > Internals::kMostMembers) throw std::bad_alloc();
@@ -219,8 +217,7 @@ void ownDictionary(PropertyList& dictionary, bool room) {
   dictionary = std::move(fresh);
 }
 
-// --- destruction
-// -------------------------------------------------------------------------------------------------------
+// --- destruction ----------------------------------------------------------------------------------------------------
 
 // Whether this was the last reference. Who sees one reference, his own, needs no atomic write.
 bool dropReference(Bits node) noexcept {
@@ -232,8 +229,7 @@ void freeNode(Bits node) noexcept {
   ::operator delete(Internals::node<void>(node));
 }
 
-// --- description
-// -------------------------------------------------------------------------------------------------------
+// --- description ----------------------------------------------------------------------------------------------------
 
 constexpr std::string_view kCutOff = "…";
 constexpr std::size_t kLongestText = 15'000;        // of a string that stands alone
@@ -347,8 +343,7 @@ std::string describeCollection(const PropertyList& collection) {
   return text;
 }
 
-// --- equality
-// ----------------------------------------------------------------------------------------------------------
+// --- equality -------------------------------------------------------------------------------------------------------
 
 bool leavesAreEqual(const PropertyList& a, const PropertyList& b) {
   switch (a.type()) {
@@ -434,8 +429,7 @@ class Comparison {
 
 }  // namespace
 
-// --- what the readers build with
-// -----------------------------------------------------------------------------------------
+// --- what the readers build with ------------------------------------------------------------------------------------
 
 PropertyList Internals::uninitializedString(std::size_t size) {
   if (size > std::numeric_limits<std::size_t>::max() / 2) throw std::bad_alloc();
@@ -497,8 +491,7 @@ void PropertyList::release(Bits node) noexcept {
   }
 }
 
-// --- making values
-// -------------------------------------------------------------------------------------------------------
+// --- making values --------------------------------------------------------------------------------------------------
 
 PropertyList::PropertyList(std::string_view text) : _bits(kFalse) {
   PropertyList made = Internals::uninitializedString(text.size());
@@ -561,8 +554,7 @@ PropertyList PropertyList::dictionary(std::vector<std::pair<std::string, Propert
   return made;
 }
 
-// --- reading values
-// ------------------------------------------------------------------------------------------------------
+// --- reading values -------------------------------------------------------------------------------------------------
 
 PropertyList::Type PropertyList::type() const {
   static constexpr std::array<Type, 16> kTypes = {
@@ -676,8 +668,7 @@ std::optional<std::uint64_t> PropertyList::uid() const {
   }
 }
 
-// --- arrays and dictionaries
-// ---------------------------------------------------------------------------------------------
+// --- arrays and dictionaries ----------------------------------------------------------------------------------------
 
 std::size_t PropertyList::count() const {
   if (!Internals::isContainer(_bits) || !isNode(_bits)) return 0;

@@ -37,7 +37,7 @@ class PropertyList {
   class Array;       // view: size(), operator[], begin(), end() over `const PropertyList&`
   class Dictionary;  // view: size(), begin(), end() over `Member`, in the dictionary's order
 
-  // --- making values -------------------------------------------------------------------------------------------
+  // --- making values ------------------------------------------------------------------------------------------------
   PropertyList(std::string_view text);    // NOLINT(google-explicit-constructor): UTF-8; not checked here
   PropertyList(const char* text);         // NOLINT(google-explicit-constructor)
   PropertyList(const std::string& text);  // NOLINT(google-explicit-constructor)
@@ -70,7 +70,7 @@ class PropertyList {
   static PropertyList array(std::vector<PropertyList> elements = {});
   static PropertyList dictionary(std::vector<std::pair<std::string, PropertyList>> members = {});  // a later key wins
 
-  // --- reading values; each answers none, null or false when the value is of another type ------------------------
+  // --- reading values; each answers none, null or false when the value is of another type ---------------------------
   Type type() const;
   bool isString() const;
   bool isArray() const;
@@ -90,7 +90,7 @@ class PropertyList {
   std::optional<std::span<const std::uint8_t>> data() const;  // valid as long as this value (or a copy) is unchanged
   std::optional<std::uint64_t> uid() const;
 
-  // --- arrays and dictionaries -------------------------------------------------------------------------------------
+  // --- arrays and dictionaries --------------------------------------------------------------------------------------
   std::size_t count() const;   // elements or members; 0 for every other type
   Array elements() const;      // an empty view when this is no array
   Dictionary members() const;  // an empty view when this is no dictionary

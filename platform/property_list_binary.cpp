@@ -61,8 +61,7 @@ std::string hex(unsigned byte) {
   return {'0', 'x', digits[byte >> 4 & 15], digits[byte & 15]};
 }
 
-// --- reading
-// -----------------------------------------------------------------------------------------------------------
+// --- reading --------------------------------------------------------------------------------------------------------
 
 class BinaryReader {
  public:
@@ -450,8 +449,7 @@ PropertyList BinaryReader::makeUTF16(std::size_t begin, std::size_t units) const
   return text;
 }
 
-// --- writing
-// -----------------------------------------------------------------------------------------------------------
+// --- writing --------------------------------------------------------------------------------------------------------
 
 // Open hash table of 64-bit keys (values' words) and object numbers.
 class ObjectsByWord {

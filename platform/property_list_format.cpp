@@ -98,27 +98,6 @@ auto guarded(ErrorOut error, const Work& work) -> std::optional<decltype(work())
   return std::nullopt;
 }
 
-// The length of the well-formed character at `position`, whose first byte is not ASCII; 0 when it is not well formed.
-std::size_t characterLength(std::string_view text, std::size_t position) {
-  const auto byte = [&](std::size_t i) {
-    return position + i < text.size() ? static_cast<unsigned char>(text[position + i]) : 0U;
-  };
-  const auto follows = [&](std::size_t i) { return (byte(i) & 0xC0U) == 0x80U; };
-  const unsigned first = byte(0);
-  if (first >= 0xC2 && first <= 0xDF) return follows(1) ? 2 : 0;
-  if (first >= 0xE0 && first <= 0xEF) {
-    const bool overlong = first == 0xE0 && byte(1) < 0xA0;
-    const bool surrogate = first == 0xED && byte(1) > 0x9F;
-    return !overlong && !surrogate && follows(1) && follows(2) ? 3 : 0;
-  }
-  if (first >= 0xF0 && first <= 0xF4) {
-    const bool overlong = first == 0xF0 && byte(1) < 0x90;
-    const bool beyond = first == 0xF4 && byte(1) > 0x8F;
-    return !overlong && !beyond && follows(1) && follows(2) && follows(3) ? 4 : 0;
-  }
-  return 0;
-}
-
 }  // namespace
 
 std::optional<PropertyList> parsePropertyList(const std::uint8_t* bytes, std::size_t size, ErrorOut error,
@@ -148,9 +127,8 @@ std::string quotedForError(std::string_view text) {
   constexpr std::size_t longest = 200;
   std::string shown;
   while (!text.empty() && shown.size() < longest) {
-    const auto first = static_cast<unsigned char>(text[0]);
-    const std::size_t length = first < 0x80 ? 1 : characterLength(text, 0);
-    if (length == 0 || first < 0x20) {
+    const std::size_t length = utf8CharacterLength(text);
+    if (length == 0 || (length == 1 && static_cast<unsigned char>(text[0]) < 0x20)) {
       shown += '?';
     } else {
       shown += text.substr(0, length);
@@ -196,45 +174,6 @@ std::optional<std::string> dateText(double secondsSince2001) {
                 static_cast<int>(clock.hours().count()), static_cast<int>(clock.minutes().count()),
                 static_cast<int>(clock.seconds().count()));
   return text.data();
-}
-
-std::size_t validUTF8Prefix(std::string_view text) {
-  std::size_t i = 0;
-  while (i < text.size()) {
-    std::uint64_t word = 0;
-    if (i + 8 <= text.size()) {
-      std::memcpy(&word, text.data() + i, 8);
-      if ((word & 0x8080'8080'8080'8080U) == 0) {
-        i += 8;
-        continue;
-      }
-    }
-    if (static_cast<unsigned char>(text[i]) < 0x80) {
-      ++i;
-      continue;
-    }
-    const std::size_t length = characterLength(text, i);
-    if (length == 0) return i;
-    i += length;
-  }
-  return i;
-}
-
-void appendUTF8(std::string& text, char32_t character) {
-  const auto add = [&text](char32_t byte) { text += static_cast<char>(static_cast<unsigned char>(byte)); };
-  if (character < 0x80) return add(character);
-  if (character < 0x800) {
-    add(0xC0 | character >> 6);
-  } else {
-    if (character < 0x10000) {
-      add(0xE0 | character >> 12);
-    } else {
-      add(0xF0 | character >> 18);
-      add(0x80 | (character >> 12 & 0x3F));
-    }
-    add(0x80 | (character >> 6 & 0x3F));
-  }
-  add(0x80 | (character & 0x3F));
 }
 
 }  // namespace appsync

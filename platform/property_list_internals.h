@@ -19,6 +19,7 @@
 #include <vector>
 
 #include "platform/property_list.h"
+#include "platform/utf8.h"
 
 namespace appsync {
 
@@ -162,9 +163,5 @@ PropertyList parseBinaryPropertyList(const std::uint8_t* bytes, std::size_t size
 PropertyList parseXMLPropertyList(const std::uint8_t* bytes, std::size_t size, const PropertyListLimits& limits);
 Bytes serializeBinaryPropertyList(const PropertyList& value);
 Bytes serializeXMLPropertyList(const PropertyList& value);
-
-// The first byte that is not part of valid UTF-8; the size when all are.
-std::size_t validUTF8Prefix(std::string_view text);
-void appendUTF8(std::string& text, char32_t character);
 
 }  // namespace appsync

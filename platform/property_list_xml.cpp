@@ -87,8 +87,7 @@ bool isXMLCharacter(std::uint32_t c) {
   return c <= 0x10FFFF && (c < 0xD800 || c > 0xDFFF) && c != 0xFFFE && c != 0xFFFF;
 }
 
-// --- reading: from bytes to text
-// -----------------------------------------------------------------------------------------
+// --- reading: from bytes to text ------------------------------------------------------------------------------------
 
 // A document's text in UTF-8, and the way back from its bytes to those of the file.
 class Document {
@@ -164,8 +163,7 @@ std::size_t Document::byteInFile(std::size_t position) const {
   return _mark + 2 * units;
 }
 
-// --- reading: markup
-// -----------------------------------------------------------------------------------------------------
+// --- reading: markup ------------------------------------------------------------------------------------------------
 
 struct Tag {
   std::string_view name;
@@ -428,8 +426,7 @@ void Scanner::appendReference() {
   _at += end + 1;
 }
 
-// --- reading: values
-// -----------------------------------------------------------------------------------------------------
+// --- reading: values ------------------------------------------------------------------------------------------------
 
 std::optional<PropertyList> integerFrom(std::string_view text) {
   text = trimmed(text);
@@ -708,8 +705,7 @@ PropertyList XMLReader::readParsed(const Tag& tag, std::optional<PropertyList> (
   return std::move(*value);
 }
 
-// --- writing
-// -------------------------------------------------------------------------------------------------------------
+// --- writing --------------------------------------------------------------------------------------------------------
 
 [[noreturn]] void cannotWrite(std::string why, Code code = Code::CannotBeWritten) {
   throw PropertyListFailure{code, std::move(why)};

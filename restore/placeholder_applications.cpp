@@ -3,7 +3,7 @@
 
 namespace appsync {
 
-// --- the placeholder's directory -----------------------------------------------------------------------------------
+// --- the placeholder's directory ------------------------------------------------------------------------------------
 
 std::string AppsClient::placeholderAppPathForBundleIdentifier(const std::string& bundleID) {
   std::string path = _platform.files->temporaryDirectory();
@@ -43,7 +43,7 @@ bool AppsClient::writeIconData(const std::optional<Bytes>& iconData, const std::
   return written;
 }
 
-// --- the registry's placeholders -----------------------------------------------------------------------------------
+// --- the registry's placeholders ------------------------------------------------------------------------------------
 
 void AppsClient::_enumeratePlaceholdersWithBlock(const PellumApplicationWorkspace::Block& block) {
   _platform.defaultWorkspace->enumerateBundlesOfType(kPellumBundleTypeAll,

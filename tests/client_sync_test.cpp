@@ -24,7 +24,7 @@ PellumApplicationProxy placeholder(const std::string& id) {
   return record;
 }
 
-// --- which packages are asked for ----------------------------------------------------------------------------------
+// --- which packages are asked for -----------------------------------------------------------------------------------
 
 TEST(Outstanding, OneNewApplicationFromEndToEnd) {
   World world;
@@ -123,7 +123,7 @@ TEST(Outstanding, StrangeRecordsOfTheRegistry) {
   EXPECT_EQ(lines.find("already installed and will be updated"), std::string::npos);
 }
 
-// --- what is in progress -------------------------------------------------------------------------------------------
+// --- what is in progress --------------------------------------------------------------------------------------------
 
 TEST(InProgress, SortsTheFirstReport) {
   World world;
@@ -200,7 +200,7 @@ TEST(InProgress, NamesOfTypesStatesAndPhases) {
   expectTranscript("install_names", all);
 }
 
-// --- preparing an install ------------------------------------------------------------------------------------------
+// --- preparing an install -------------------------------------------------------------------------------------------
 
 TEST(Prepare, EachStepFailingAlone) {
   std::string all;
@@ -280,7 +280,7 @@ TEST(Uninstall, LogsTheSameWordsWhetherOrNotItFails) {
   expectTranscript("uninstall", lines);
 }
 
-// --- transfers -----------------------------------------------------------------------------------------------------
+// --- transfers ------------------------------------------------------------------------------------------------------
 
 constexpr char kOpenCoordinator[] =
     R"({"coordinators": [{"identifier": "org.a", "kind": "initiating", "creator": 3, "assetPromise": "open"},
@@ -386,7 +386,7 @@ TEST(InstallResults, MarkAndClean) {
   expectTranscript("install_results", lines);
 }
 
-// --- callbacks -----------------------------------------------------------------------------------------------------
+// --- callbacks ------------------------------------------------------------------------------------------------------
 
 TEST(Callbacks, WhatEachDoes) {
   World world;
@@ -441,7 +441,7 @@ TEST(Callbacks, ACancellationIsPassedOnOnceASync) {
   EXPECT_NE(cancel().find("Cancelling asset sync for org.a"), std::string::npos);
 }
 
-// --- placeholders on disk, icons, order ----------------------------------------------------------------------------
+// --- placeholders on disk, icons, order -----------------------------------------------------------------------------
 
 TEST(PlaceholderApplications, DirectoriesAndIcons) {
   World world;

@@ -69,8 +69,7 @@ class BaseTest : public testing::Test {
   std::string root;
 };
 
-// --- files and crashes
-// -------------------------------------------------------------------------------------------------
+// --- files and crashes ----------------------------------------------------------------------------------------------
 
 // From one call on nothing reaches the disk any more, a write half way. What was not flushed then is lost.
 class PowerCut : public Disk {
@@ -269,8 +268,7 @@ TEST_F(BaseTest, FailedWriteLeavesTheOldFileAndNoTemporaryOne) {
   }
 }
 
-// --- files and paths
-// ---------------------------------------------------------------------------------------------------
+// --- files and paths ------------------------------------------------------------------------------------------------
 
 TEST_F(BaseTest, NothingLeadsOutsideOrToTheDevicesOwnRecords) {
   put(top / "outside/secret", "secret");
@@ -377,8 +375,7 @@ TEST_F(BaseTest, MovingNeverReplaces) {
   }
 }
 
-// --- records
-// -----------------------------------------------------------------------------------------------------------
+// --- records --------------------------------------------------------------------------------------------------------
 
 TEST_F(BaseTest, RecordsAreFoundByTheirNamesAlone) {
   Disk disk;
@@ -432,8 +429,7 @@ TEST_F(BaseTest, SettingsAnswerForPoliciesAndPlaceholders) {
   EXPECT_TRUE(error && error->text().find("CreateAppPlaceholders") != std::string::npos);
 }
 
-// --- log
-// ---------------------------------------------------------------------------------------------------------------
+// --- log ------------------------------------------------------------------------------------------------------------
 
 TEST(EmbeddedLogTest, SinkIsCalledOneCallAtATimeAndOnlyWhenItListens) {
   struct Sink : LogSink {
@@ -477,8 +473,7 @@ TEST(EmbeddedLogTest, SinkIsCalledOneCallAtATimeAndOnlyWhenItListens) {
   EXPECT_EQ(sink.messages.size(), 3U);
 }
 
-// --- executors and waiting
-// ---------------------------------------------------------------------------------------------
+// --- executors and waiting ------------------------------------------------------------------------------------------
 
 TEST(ExecutorTest, StrandsKeepTheirOrderAndASeedGivesItAgain) {
   const auto run = [](Executor& executor) {
@@ -583,8 +578,7 @@ TEST(EmbeddedWaitingTest, FastTimeJumpsOnlyWhenNothingIsToCome) {
   EXPECT_LT(waiting.now(), begin + std::chrono::hours(2));
 }
 
-// --- notifications
-// -----------------------------------------------------------------------------------------------------
+// --- notifications --------------------------------------------------------------------------------------------------
 
 TEST_F(BaseTest, NoNotificationRunsAfterItsObserverIsRemoved) {
   struct Observer {
@@ -624,8 +618,7 @@ TEST_F(BaseTest, NoNotificationRunsAfterItsObserverIsRemoved) {
   EXPECT_EQ(selfish.heard, 1);
 }
 
-// --- the whole device
-// --------------------------------------------------------------------------------------------------
+// --- the whole device -----------------------------------------------------------------------------------------------
 
 class DeviceTest : public BaseTest {
  protected:
@@ -714,6 +707,7 @@ TEST_F(DeviceTest, OneUnreadableRecordDoesNotMakeTheDeviceUnusable) {
   put(root + "/state/applications/org.a.plist", "<plist>");
   put(root + "/var/mobile/.tmp-appsync-0123456789abcdef", "left by a crash");
   put(root + "/var/mobile/.tmp-appsync-mine", "somebody's own");
+  put(root + "/var/mobile/Containers/1/A.app/data/.tmp-appsync-0123456789abcdef", "the application's own");
   const auto device = open();
   ASSERT_TRUE(device);
   ASSERT_EQ(device->repairs().size(), 2U);
@@ -721,6 +715,8 @@ TEST_F(DeviceTest, OneUnreadableRecordDoesNotMakeTheDeviceUnusable) {
   EXPECT_TRUE(fs::exists(root + "/state/applications/org.a.plist.damaged"));
   EXPECT_FALSE(fs::exists(root + "/var/mobile/.tmp-appsync-0123456789abcdef"));
   EXPECT_TRUE(fs::exists(root + "/var/mobile/.tmp-appsync-mine"));
+  // The container may be that of the application whose record is damaged, and what it holds is its own.
+  EXPECT_TRUE(fs::exists(root + "/var/mobile/Containers/1/A.app/data/.tmp-appsync-0123456789abcdef"));
 }
 
 PropertyList dictionary(std::vector<std::pair<std::string, PropertyList>> members) {

@@ -13,7 +13,7 @@ namespace {
 
 using test::RegistryDevice;
 
-// --- archives, byte by byte ----------------------------------------------------------------------
+// --- archives, byte by byte -----------------------------------------------------------------------------------------
 
 struct Entry {
   std::string name;
@@ -94,7 +94,7 @@ Bytes package(const std::string& version, std::vector<Entry> more = {}) {
 
 constexpr unsigned kLink = S_IFLNK | 0777;
 
-// --- good ones -----------------------------------------------------------------------------------
+// --- good ones ------------------------------------------------------------------------------------------------------
 
 TEST(Package, installs) {
   RegistryDevice device;
@@ -132,7 +132,7 @@ TEST(Package, installs) {
   EXPECT_TRUE(device.files->fileExists("/var/mobile/Media/p.ipa"));
 }
 
-// --- bad ones ------------------------------------------------------------------------------------
+// --- bad ones -------------------------------------------------------------------------------------------------------
 
 struct BadPackage {
   const char* name;
@@ -277,7 +277,7 @@ TEST(Package, cancellingLeavesTheOldVersion) {
   EXPECT_GT(asked, 4);
 }
 
-// --- the disk ------------------------------------------------------------------------------------
+// --- the disk -------------------------------------------------------------------------------------------------------
 
 // Old or new, whole, with the placeholder exactly beside the old one, and nothing else.
 void expectOldOrNew(RegistryDevice& device, bool installed) {
@@ -322,7 +322,7 @@ TEST(Package, everyFailureOfTheDiskLeavesOldOrNewWhole) {
   EXPECT_GT(failures, 20);
 }
 
-// --- what was uninstalled ------------------------------------------------------------------------
+// --- what was uninstalled -------------------------------------------------------------------------------------------
 
 TEST(Installer, remembersWhatWasUninstalled) {
   RegistryDevice device;

@@ -89,7 +89,7 @@ class Observer : public PellumApplicationWorkspaceObserver {
   std::vector<std::string> _heard;
 };
 
-// --- walks and look-ups --------------------------------------------------------------------------
+// --- walks and look-ups ---------------------------------------------------------------------------------------------
 
 TEST(Registry, walksBySortedClassOnASnapshot) {
   RegistryDevice device;
@@ -181,7 +181,7 @@ TEST(Registry, sweepsOnlyWhatNoRecordNames) {
   EXPECT_FALSE(device.registry->applicationIsInstalled("org.a"));
 }
 
-// --- observers -----------------------------------------------------------------------------------
+// --- observers ------------------------------------------------------------------------------------------------------
 
 TEST(Registry, everyLiveInstallIsInExactlyOneList) {
   RegistryDevice device;
@@ -293,7 +293,7 @@ TEST(Registry, observersComeAndGoWhileInstallsChange) {
   for (std::thread& thread : threads) thread.join();
 }
 
-// --- status and seed -----------------------------------------------------------------------------
+// --- status and seed ------------------------------------------------------------------------------------------------
 
 TEST(RegistrySeed, whatOneDeviceShowsSeedsAnother) {
   RegistryDevice first;
@@ -354,7 +354,7 @@ TEST(RegistrySeed, badEntriesAreNamed) {
   EXPECT_FALSE(checkInstalledSeed(PropertyList::array({"x"}), &error));
 }
 
-// --- the home screen -----------------------------------------------------------------------------
+// --- the home screen ------------------------------------------------------------------------------------------------
 
 std::string shown(RegistryDevice& device) {
   std::string all;
@@ -396,7 +396,7 @@ TEST(HomeScreen, showsTheLayoutThenWhatCame) {
   EXPECT_EQ(shown(device), "org.b org.a");
 }
 
-// --- icons ---------------------------------------------------------------------------------------
+// --- icons ----------------------------------------------------------------------------------------------------------
 
 Image plain(std::uint32_t width, std::uint32_t height, std::uint8_t red) {
   Image image{width, height, {}};
