@@ -364,8 +364,12 @@ TEST(Transfer, AnUpdateIsRememberedUntilItsEnd) {
   world.settle();
   assets[0]->setPath("missing.ipa");
   std::string all = world.transcript([&] { world.client().assetTransferUpdatedProgress(assets[0], 0.5); });
-  all += world.transcript([&] { world.client().assetTransferSucceeded(assets[0], true, std::nullopt); });
-  all += world.logLines([&] { world.settle(); }, true);
+  all += world.logLines(
+      [&] {
+        world.client().assetTransferSucceeded(assets[0], true, std::nullopt);
+        world.settle();
+      },
+      true);
   all += world.transcript([&] { world.client().assetTransferUpdatedProgress(assets[0], 0.7); });
   EXPECT_TRUE(world.device().registry().applicationIsInstalled("org.here"));
   EXPECT_EQ(world.todo(), "org.here=FAILED");
