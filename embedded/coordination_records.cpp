@@ -109,7 +109,7 @@ PropertyList recordOf(const CoordinationPromise& promise) {
 std::shared_ptr<CoordinationPromise> promiseFrom(const std::optional<PropertyList>& record,
                                                  const std::shared_ptr<InstallCoordinator>& owner) {
   if (!record) return nullptr;
-  const auto promise = std::make_shared<CoordinationPromise>();
+  auto promise = std::make_shared<CoordinationPromise>();
   promise->name = text(*record, "Name").value_or(owner->bundleID);
   promise->path = text(*record, "Path");
   promise->isComplete = flag(*record, "Complete");
@@ -182,7 +182,7 @@ std::shared_ptr<InstallCoordinator> coordinatorFromRecord(const std::string& bun
   const auto kind = kindNamed(text(record, "Kind").value_or(""));
   const auto creator = number(record, "Creator");
   if (!kind || !creator) return nullptr;
-  const auto coordinator = std::make_shared<InstallCoordinator>();
+  auto coordinator = std::make_shared<InstallCoordinator>();
   coordinator->kind = *kind;
   coordinator->bundleID = bundleID;
   coordinator->creator = *creator;

@@ -5,6 +5,7 @@
 #include <cmath>
 #include <cstdint>
 #include <cstdio>
+#include <limits>
 #include <span>
 #include <vector>
 
@@ -107,6 +108,7 @@ const Json* onlyMember(const Json& object, const char* key) {
 }
 
 std::optional<PropertyList> tagged(const Json& value) {
+  constexpr double kInfinity = std::numeric_limits<double>::infinity();
   if (const Json* data = onlyMember(value, "$data"); data != nullptr && data->is_string()) {
     if (auto bytes = fromBase64(data->get_ref<const std::string&>())) return PropertyList::data(*bytes);
   }
@@ -122,8 +124,8 @@ std::optional<PropertyList> tagged(const Json& value) {
   if (const Json* real = onlyMember(value, "$real"); real != nullptr && real->is_string()) {
     const auto& text = real->get_ref<const std::string&>();
     if (text == "nan") return PropertyList::real(std::nan(""));
-    if (text == "inf") return PropertyList::real(INFINITY);
-    if (text == "-inf") return PropertyList::real(-INFINITY);
+    if (text == "inf") return PropertyList::real(kInfinity);
+    if (text == "-inf") return PropertyList::real(-kInfinity);
   }
   return std::nullopt;
 }

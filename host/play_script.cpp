@@ -188,7 +188,7 @@ std::vector<Action> actions() {
 // What is wrong with a step; empty, with the step read, when nothing is.
 std::string readStep(const Json& content, PlayStep& step) {
   if (!content.is_object() || !content.contains("do")) return "must be an object with \"do\"";
-  if (const std::string wrong = checkFields(content, kArguments.data(), kArguments.data() + kArguments.size());
+  if (std::string wrong = checkFields(content, kArguments.data(), kArguments.data() + kArguments.size());
       !wrong.empty()) {
     return wrong;
   }

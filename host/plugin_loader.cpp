@@ -25,7 +25,7 @@ std::string pathOfThisProgram() {
 
 std::string pathOfPlugin(const std::optional<std::string>& file) {
   if (file) return std::filesystem::absolute(*file).string();  // a bare name is a file here, not one of the system's
-  const std::string beside = pathOfThisProgram() + "/AppSync.so";
+  std::string beside = pathOfThisProgram() + "/AppSync.so";
   if (::access(beside.c_str(), F_OK) == 0) return beside;
   const std::string installed = pathOfThisProgram() + "/../lib/appsync/AppSync.so";
   return ::access(installed.c_str(), F_OK) == 0 ? installed : beside;

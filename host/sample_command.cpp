@@ -155,7 +155,6 @@ class SampleWriter {
     while (bytes.size() < size) {
       std::uint64_t word = dice.next();
       for (int i = 0; i < 8; ++i, word >>= 8U) bytes += static_cast<char>(word & 0xFFU);
-      bytes += "\0\0\0\0\0\0\0\0";
       bytes.append(8, '\0');
     }
     return bytes;

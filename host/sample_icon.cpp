@@ -38,8 +38,10 @@ bool isInFigure(std::uint64_t number, double x, double y) {
 double coverage(std::uint64_t number, std::uint32_t x, std::uint32_t y, std::uint32_t size) {
   int inside = 0;
   for (int i = 0; i < 16; ++i) {
-    const double px = (x + (i % 4 + 0.5) / 4) / size;
-    const double py = (y + (i / 4 + 0.5) / 4) / size;
+    const int column = i % 4;
+    const int row = i / 4;
+    const double px = (x + (column + 0.5) / 4) / size;
+    const double py = (y + (row + 0.5) / 4) / size;
     inside += isInFigure(number, px, py) ? 1 : 0;
   }
   return inside / 16.0;

@@ -75,7 +75,7 @@ bool Instruments::addFault(const std::string& spec, ErrorOut error) {
   return _parts->probe.faults.add(spec, false, std::nullopt, error);
 }
 
-bool Instruments::addFaultWithError(const std::string& spec, std::optional<Error> given, ErrorOut error) {
+bool Instruments::addFaultWithError(const std::string& spec, const std::optional<Error>& given, ErrorOut error) {
   return _parts->probe.faults.add(spec, true, given, error);
 }
 

@@ -60,7 +60,7 @@ class Instruments {
   bool addFault(const std::string& spec, ErrorOut error);
 
   // The same, failing with `given` where the operation brings an error; without one it fails and brings none.
-  bool addFaultWithError(const std::string& spec, std::optional<Error> given, ErrorOut error);
+  bool addFaultWithError(const std::string& spec, const std::optional<Error>& given, ErrorOut error);
 
   void clearFaults();
 

@@ -29,7 +29,7 @@ void appendToFile(const std::string& path, const std::string& line) {
 Recorder::Recorder(bool recording, std::string reachedTextsFile)
     : _recording(recording), _reachedTextsFile(std::move(reachedTextsFile)) {}
 
-void Recorder::add(InstrumentedService service, std::string text) {
+void Recorder::add(InstrumentedService service, const std::string& text) {
   if (!isRecording()) return;
   MutexLock lock(_mutex);
   _lines.push_back({service, std::this_thread::get_id(), onOneLine(text)});

@@ -62,7 +62,7 @@ class Recorder {
   // Whether somebody wants to see log lines.
   bool wantsFormats() const { return isRecording() || !_reachedTextsFile.empty(); }
 
-  void add(InstrumentedService service, std::string text);
+  void add(InstrumentedService service, const std::string& text);
   void addCallback(InstrumentedService service, const std::string& text) { add(service, "<- " + text); }
   void addFormat(Format format);
 

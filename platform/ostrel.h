@@ -51,7 +51,7 @@ struct OstrelRef {
   std::uint64_t value = 0;  // 0: none
 
   explicit operator bool() const { return value != 0; }
-  friend auto operator<=>(const OstrelRef&, const OstrelRef&) = default;
+  friend auto operator<=>(const OstrelRef&, const OstrelRef&) = default;  // NOLINT(modernize-use-nullptr)
 };
 
 // What the home screen needs to know of an application that is not there yet.
