@@ -102,7 +102,8 @@ class EmbeddedCoordination : public OstrelService {
   // The device paths of packages that are promised complete and not installed or given up yet.
   std::vector<std::string> packagePathsInUse();
 
-  // Called on the application's strand after the observers have heard the same. Null: nobody listens.
+  // Called on the application's strand after the observers have heard the same, so for different applications at the
+  // same time. Null: nobody listens.
   void setEventListener(std::function<void(const CoordinatorEvent&)> listener);
 
   // Asked before a package is unpacked; an error it answers fails the install. Null: nobody is asked.

@@ -2,6 +2,7 @@
 
 #include <filesystem>
 #include <fstream>
+#include <mutex>
 #include <thread>
 
 #include "embedded/coordination.h"
@@ -173,8 +174,10 @@ TEST_F(EmbeddedCoordinationTest, WhoeverComesFirstEveryInstallEndsOnce) {
 }
 
 TEST_F(EmbeddedCoordinationTest, TellsThePersonAndTheHostWhatItDoes) {
+  std::mutex guard;  // events of different applications come at the same time
   Lines events;
   bare.coordination().setEventListener([&](const CoordinatorEvent& event) {
+    const std::lock_guard lock(guard);
     events.push_back(event.bundleID + std::to_string(static_cast<int>(event.kind)) + (event.error ? " failed" : ""));
   });
   bare.coordination().setInstallGate([&](const std::string& bundleID) {
