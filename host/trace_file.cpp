@@ -41,7 +41,16 @@ TraceFile::TraceFile(std::string path, int file) : _path(std::move(path)), _file
   add({{"ph", "M"}, {"pid", kProcess}, {"name", "process_name"}, {"args", {{"name", "dovel"}}}});
 }
 
+// Where memory has run out the document stays without its end, and nothing else suffers.
 TraceFile::~TraceFile() {
+  try {
+    finish();
+  } catch (...) {
+  }
+  ::close(_file);
+}
+
+void TraceFile::finish() {
   MutexLock lock(_mutex);
   const Time now = std::chrono::system_clock::now();
   for (const auto& [key, steps] : _openSteps) {
@@ -52,7 +61,6 @@ TraceFile::~TraceFile() {
     }
   }
   write("\n]}\n");
-  ::close(_file);
 }
 
 void TraceFile::transaction(const TransactionRecord& record) {
@@ -117,7 +125,7 @@ int TraceFile::trackOf(const std::optional<std::string>& identifier) {
   return place->second;
 }
 
-void TraceFile::add(Json event) {
+void TraceFile::add(const Json& event) {
   write((_hasEvents ? ",\n" : "\n") + jsonLine(event));
   _hasEvents = true;
 }

@@ -46,7 +46,8 @@ class TraceFile : public LogSink {
   void addSpan(int track, const std::string& name, Time begin, Time end, const Json& details) APPSYNC_REQUIRES(_mutex);
   void addMoment(int track, const std::string& name, Time time, const Json& details) APPSYNC_REQUIRES(_mutex);
   int trackOf(const std::optional<std::string>& identifier) APPSYNC_REQUIRES(_mutex);
-  void add(Json event) APPSYNC_REQUIRES(_mutex);
+  void finish();
+  void add(const Json& event) APPSYNC_REQUIRES(_mutex);
   void write(const std::string& text) APPSYNC_REQUIRES(_mutex);
 
   const std::string _path;

@@ -105,6 +105,7 @@ void Transfers::askForOrder(const std::vector<DovelAssetRef>& assets) {
 
 void Transfers::beginDisplay(const std::vector<DovelAssetRef>& assets) {
   std::vector<std::pair<std::string, std::string>> names;
+  names.reserve(assets.size());
   for (const DovelAssetRef& asset : assets) {
     names.emplace_back(asset->identifier(), asset->prettyName().value_or(asset->identifier()));
   }
