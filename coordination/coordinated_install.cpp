@@ -175,8 +175,7 @@ void AppsClient::cancelPreparation(const InstallPreparation& install) {
 // A file that is missing, cannot be parsed or holds something else gives none.
 std::optional<PropertyList> AppsClient::dictionaryAtPath(const std::optional<std::string>& path) {
   const std::optional<Bytes> bytes = path ? _platform.files->readFile(*path, nullptr) : std::nullopt;
-  std::optional<PropertyList> value = bytes ? parsePropertyList(*bytes, nullptr) : std::nullopt;
-  return value && value->isDictionary() ? value : std::nullopt;
+  return bytes ? parseDictionary(*bytes, nullptr) : std::nullopt;
 }
 
 void AppsClient::uninstallAppUsingCoordination(const std::string& bundleID) {

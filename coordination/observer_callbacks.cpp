@@ -35,12 +35,12 @@ void AppsClient::coordinatorShouldPrioritize(const OstrelAppInstallCoordinator& 
   const std::optional<std::string> bundleID = coordinator.bundleID();
   if (!bundleID) return;
   _log("Prioritize %{public}@", *bundleID);
-  if (!_platform.deviceService->offers(DovelDeviceService::Operation::PrioritizeAsset)) {
+  if (!_platform.sharedInstance->offers(DovelDeviceService::Operation::PrioritizeAsset)) {
     _log.error("Cannot prioritize %{public}@ as it's not supported", *bundleID);
     return;
   }
   // The completion may come when the client is gone.
-  _platform.deviceService->prioritizeAsset(
+  _platform.sharedInstance->prioritizeAsset(
       bareAsset(*bundleID), [log = _log, bundleID = *bundleID](const std::optional<Error>& error) {
         log("Prioritize %{public}@ finished with error %{public}@", bundleID, error);
       });
@@ -57,9 +57,9 @@ void AppsClient::coordinatorCanceledWithReason(const OstrelAppInstallCoordinator
     alreadyCancelled = !_userCancelledApps.insert(*bundleID).second;
   }
   if (!alreadyCancelled &&
-      _platform.deviceService->offers(DovelDeviceService::Operation::CancelAssetTransferForFailedAsset)) {
+      _platform.sharedInstance->offers(DovelDeviceService::Operation::CancelAssetTransferForFailedAsset)) {
     _log("Cancelling asset sync for %{public}@", *bundleID);
-    _platform.deviceService->cancelAssetTransferForFailedAsset(bareAsset(*bundleID));
+    _platform.sharedInstance->cancelAssetTransferForFailedAsset(bareAsset(*bundleID));
     return;
   }
   _log.error("Cannot cancel %{public}@ as it's already cancelled %d OR the call is not supported", *bundleID,

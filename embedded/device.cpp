@@ -120,7 +120,7 @@ Platform Device::platform() {
   platform.icons = &_parts->icons;
   platform.notifications = &_parts->notifications;
   platform.notificationCenter = &_parts->notificationCenter;
-  platform.deviceService = &_parts->deviceService;
+  platform.sharedInstance = &_parts->deviceService;
   return platform;
 }
 

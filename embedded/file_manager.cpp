@@ -319,14 +319,14 @@ std::string EmbeddedFileManager::strerror(int errorNumber) {
 
 // --- writing --------------------------------------------------------------------------------------------------------
 
-bool EmbeddedFileManager::writeFile(const std::string& path, const Bytes& bytes, ErrorOut error) {
+bool EmbeddedFileManager::writeFile(const std::string& path, BytesView bytes, ErrorOut error) {
   const int result =
       replaceFile(path, {}, [&](int file) { return resultOf(writeAll(_disk, file, bytes.data(), bytes.size())); });
   if (result != 0) setError(error, this->error("write", path, result));
   return result == 0;
 }
 
-bool EmbeddedFileManager::createFile(const std::string& path, const Bytes& bytes, const FileAttributes& attributes) {
+bool EmbeddedFileManager::createFile(const std::string& path, BytesView bytes, const FileAttributes& attributes) {
   return replaceFile(path, attributes,
                      [&](int file) { return resultOf(writeAll(_disk, file, bytes.data(), bytes.size())); }) == 0;
 }

@@ -57,8 +57,8 @@ class EmbeddedFileManager : public FileManager {
   std::string temporaryDirectory() override;
   bool fileExists(const std::string& path) override;
   std::optional<Bytes> readFile(const std::string& path, ErrorOut error) override;
-  bool writeFile(const std::string& path, const Bytes& bytes, ErrorOut error) override;
-  bool createFile(const std::string& path, const Bytes& bytes, const FileAttributes& attributes) override;
+  bool writeFile(const std::string& path, BytesView bytes, ErrorOut error) override;
+  bool createFile(const std::string& path, BytesView bytes, const FileAttributes& attributes) override;
   bool createDirectory(const std::string& path, bool intermediateDirectories, const FileAttributes& attributes,
                        ErrorOut error) override;
   bool removeItem(const std::string& path, ErrorOut error) override;

@@ -17,7 +17,7 @@ constexpr std::size_t kDeepest = 512;
 constexpr std::string_view kBase64 = "ABCDEFGHIJKLMNOPQRSTUVWXYZabcdefghijklmnopqrstuvwxyz0123456789+/";
 constexpr double kSecondsFrom1970 = 978307200;
 
-std::string base64(std::span<const std::uint8_t> bytes) {
+std::string base64(BytesView bytes) {
   std::string text;
   text.reserve((bytes.size() + 2) / 3 * 4);
   for (std::size_t at = 0; at < bytes.size(); at += 3) {

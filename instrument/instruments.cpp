@@ -23,7 +23,7 @@ struct Instruments::Parts {
         icons(wrap(*bare.icons, probe)),
         notifications(wrap(*bare.notifications, probe)),
         notificationCenter(wrap(*bare.notificationCenter, probe)),
-        deviceService(wrap(*bare.deviceService, probe, lacking)) {}
+        deviceService(wrap(*bare.sharedInstance, probe, lacking)) {}
 
   Probe probe;
   LackingOperations lacking;
@@ -67,7 +67,7 @@ Platform Instruments::platform() {
   platform.icons = _parts->icons.get();
   platform.notifications = _parts->notifications.get();
   platform.notificationCenter = _parts->notificationCenter.get();
-  platform.deviceService = _parts->deviceService.get();
+  platform.sharedInstance = _parts->deviceService.get();
   return platform;
 }
 

@@ -26,7 +26,7 @@ std::string shown(double fraction) {
   return {text.data(), end};
 }
 
-std::string shown(const Bytes& bytes) {
+std::string shown(BytesView bytes) {
   return std::to_string(bytes.size()) + " bytes";
 }
 

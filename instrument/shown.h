@@ -60,7 +60,7 @@ inline std::string shown(const Error& error) {
   return error.description();
 }
 std::string shown(double fraction);  // the shortest text of the number
-std::string shown(const Bytes& bytes);
+std::string shown(BytesView bytes);
 std::string shown(const FileInformation& information);
 std::string shown(const FileAttributes& attributes);  // "as OWNER:GROUP"; a name that is absent is "-"
 std::string shown(const std::set<OstrelClientID>& clients);

@@ -28,11 +28,11 @@ class WrappedFileManager : public FileManager {
     };
     return _probe.call("readFile", Subject::path(path), error, answer, path);
   }
-  bool writeFile(const std::string& path, const Bytes& bytes, ErrorOut error) override {
+  bool writeFile(const std::string& path, BytesView bytes, ErrorOut error) override {
     const auto forward = [&](ErrorOut out) { return _bare.writeFile(path, bytes, out); };
     return _probe.call("writeFile", Subject::path(path), error, forward, path, bytes);
   }
-  bool createFile(const std::string& path, const Bytes& bytes, const FileAttributes& attributes) override {
+  bool createFile(const std::string& path, BytesView bytes, const FileAttributes& attributes) override {
     const auto forward = [&](ErrorOut) { return _bare.createFile(path, bytes, attributes); };
     return _probe.call("createFile", Subject::path(path), nullptr, forward, path, bytes, attributes);
   }

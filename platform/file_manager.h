@@ -47,10 +47,10 @@ class FileManager {
 
   // Replaces or makes the file in one step: whoever reads sees the old bytes or the new ones, also after a crash or
   // loss of power at any instant. False, with an error, leaves the old file as it was.
-  virtual bool writeFile(const std::string& path, const Bytes& bytes, ErrorOut error) = 0;
+  virtual bool writeFile(const std::string& path, BytesView bytes, ErrorOut error) = 0;
 
   // Makes the file with these bytes and attributes; a file that is there is overwritten.
-  virtual bool createFile(const std::string& path, const Bytes& bytes, const FileAttributes& attributes) = 0;
+  virtual bool createFile(const std::string& path, BytesView bytes, const FileAttributes& attributes) = 0;
 
   // Makes the directory. With `intermediateDirectories` its missing parents too (with the same attributes), and a
   // directory that is there already is success; without, it is an error.

@@ -38,7 +38,7 @@ struct Platform {
   IconServices* icons = nullptr;
   NotificationService* notifications = nullptr;
   NotificationCenter* notificationCenter = nullptr;
-  DovelDeviceService* deviceService = nullptr;
+  DovelDeviceService* sharedInstance = nullptr;  // of the daemon's device service
 };
 
 }  // namespace appsync

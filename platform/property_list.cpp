@@ -527,7 +527,7 @@ PropertyList PropertyList::date(double secondsSince2001) {
   return Internals::adopt(realBits(secondsSince2001, Internals::kDate, Internals::kDateNode));
 }
 
-PropertyList PropertyList::data(std::span<const std::uint8_t> bytes) {
+PropertyList PropertyList::data(BytesView bytes) {
   void* memory = ::operator new(sizeof(DataNode) + bytes.size());
   auto* node = ::new (memory) DataNode{1, bytes.size()};
   if (!bytes.empty()) std::memcpy(Internals::bytes(node), bytes.data(), bytes.size());
@@ -651,10 +651,10 @@ std::optional<double> PropertyList::date() const {
   }
 }
 
-std::optional<std::span<const std::uint8_t>> PropertyList::data() const {
+std::optional<BytesView> PropertyList::data() const {
   if (Internals::tag(_bits) != Internals::kData) return std::nullopt;
   auto* node = Internals::node<DataNode>(_bits);
-  return std::span<const std::uint8_t>(Internals::bytes(node), node->size);
+  return BytesView(Internals::bytes(node), node->size);
 }
 
 std::optional<std::uint64_t> PropertyList::uid() const {

@@ -26,6 +26,7 @@
 namespace appsync {
 
 using Bytes = std::vector<std::uint8_t>;
+using BytesView = std::span<const std::uint8_t>;  // valid as long as what it shows
 
 class PropertyList {
  public:
@@ -65,7 +66,7 @@ class PropertyList {
   static PropertyList real(double value);
   static PropertyList real32(float value);  // keeps its width when written; equal to the `real` of the same value
   static PropertyList date(double secondsSince2001);  // seconds since 2001-01-01T00:00:00Z, may be fractional
-  static PropertyList data(std::span<const std::uint8_t> bytes);  // copies them
+  static PropertyList data(BytesView bytes);          // copies them
   static PropertyList uid(std::uint64_t value);
   static PropertyList array(std::vector<PropertyList> elements = {});
   static PropertyList dictionary(std::vector<std::pair<std::string, PropertyList>> members = {});  // a later key wins
@@ -87,7 +88,7 @@ class PropertyList {
   // with a digit 1 to 9 or one of "YyTt" after blanks, signs and zeros; none for every other type.
   std::optional<bool> flag() const;
   std::optional<double> date() const;
-  std::optional<std::span<const std::uint8_t>> data() const;  // valid as long as this value (or a copy) is unchanged
+  std::optional<BytesView> data() const;  // valid as long as this value (or a copy) is unchanged
   std::optional<std::uint64_t> uid() const;
 
   // --- arrays and dictionaries --------------------------------------------------------------------------------------
@@ -210,6 +211,7 @@ enum class PropertyListErrorCode : std::int64_t {
   BeyondLimits = 2,     // they would be one, but a reader's or writer's limit forbids it
   CannotBeWritten = 3,  // the format has no place for the value
   NoMemory = 4,
+  UnexpectedRoot = 5,  // the outermost value is of another type than was asked for
 };
 
 enum class PropertyListFormat : std::uint8_t { XML, Binary };
@@ -227,7 +229,9 @@ struct PropertyListLimits {
 std::optional<PropertyList> parsePropertyList(const std::uint8_t* bytes, std::size_t size, ErrorOut error,
                                               const PropertyListLimits& limits = {},
                                               PropertyListFormat* format = nullptr);
-std::optional<PropertyList> parsePropertyList(const Bytes& bytes, ErrorOut error);
+std::optional<PropertyList> parsePropertyList(BytesView bytes, ErrorOut error);
+// The same for a list whose outermost value has to be a dictionary: any other is an error too.
+std::optional<PropertyList> parseDictionary(BytesView bytes, ErrorOut error);
 
 // Writes a property list. Binary output holds each distinct string once. None, with an error, when the value cannot be
 // written: deeper than 512 levels, a string that is not UTF-8 or that XML cannot hold, a date outside the format's

@@ -109,8 +109,17 @@ std::optional<PropertyList> parsePropertyList(const std::uint8_t* bytes, std::si
   });
 }
 
-std::optional<PropertyList> parsePropertyList(const Bytes& bytes, ErrorOut error) {
+std::optional<PropertyList> parsePropertyList(BytesView bytes, ErrorOut error) {
   return parsePropertyList(bytes.data(), bytes.size(), error);
+}
+
+std::optional<PropertyList> parseDictionary(BytesView bytes, ErrorOut error) {
+  std::optional<PropertyList> value = parsePropertyList(bytes, error);
+  if (!value || value->isDictionary()) return value;
+  setError(error, Error(std::string(kPropertyListErrorDomain),
+                        static_cast<std::int64_t>(PropertyListErrorCode::UnexpectedRoot),
+                        "The outermost value of the property list must be a dictionary"));
+  return std::nullopt;
 }
 
 std::optional<Bytes> serializePropertyList(const PropertyList& value, PropertyListFormat format, ErrorOut error) {

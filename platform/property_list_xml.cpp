@@ -728,7 +728,7 @@ class XMLWriter {
   void writeEscaped(std::string_view text);
   void writeReal(double value);
   void writeDate(double value);
-  void writeData(std::span<const std::uint8_t> bytes);
+  void writeData(BytesView bytes);
   void writeUID(std::uint64_t value);
 
   void checkDepth() const {
@@ -862,7 +862,7 @@ void XMLWriter::writeDate(double value) {
   writeText("date", *text);
 }
 
-void XMLWriter::writeData(std::span<const std::uint8_t> bytes) {
+void XMLWriter::writeData(BytesView bytes) {
   static constexpr std::string_view alphabet = "ABCDEFGHIJKLMNOPQRSTUVWXYZabcdefghijklmnopqrstuvwxyz0123456789+/";
   constexpr std::size_t bytesPerLine = 57;
   put("<data>\n");

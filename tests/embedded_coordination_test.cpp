@@ -211,10 +211,10 @@ TEST_F(EmbeddedCoordinationTest, KeepsTheIconThatWasHandedOver) {
   const auto icon = OstrelPromisedTransferToPath::initWithName(client().service(), "org.a-Icon", 3,
                                                                FileURL::fileURLWithPath(path, false), 2);
   const auto placeholder = client().placeholder("org.a");
-  client().files().createFile(path, {1, 2}, {});
+  client().files().createFile(path, Bytes{1, 2}, {});
   icon.setComplete(true);
   ASSERT_TRUE(placeholder.setIconPromise(icon, nullptr) && held.setPlaceholderPromise(placeholder, nullptr));
-  client().files().createFile(path, {3}, {});
+  client().files().createFile(path, Bytes{3}, {});
   held = {};
   bare.settle();
   const auto shown = client().registry().applicationProxyForIdentifier("org.a", true);

@@ -132,7 +132,7 @@ void callEverything(InstrumentedDevice& device) {
     coordinator.cancelForReason(Error("E", 7), OstrelClientDovel, nullptr);
   }
   service.uninstallApp("org.b", false, {});
-  platform.deviceService->prioritizeAsset(DovelAsset::downloadAssetWithIdentifier("org.b", "Application", {}), {});
+  platform.sharedInstance->prioritizeAsset(DovelAsset::downloadAssetWithIdentifier("org.b", "Application", {}), {});
 
   platform.defaultWorkspace->uninstallApplication("org.b", nullptr);
   platform.installer->KilnLookupUninstalled();
@@ -460,8 +460,8 @@ TEST(InstrumentTest, AScriptAnswersInTheServicesPlace) {
   EXPECT_EQ(walked, "org.strange");
   platform.files->moveItem("/no", "/where", nullptr);
   EXPECT_EQ(around, "/no");
-  EXPECT_FALSE(platform.deviceService->offers(DovelDeviceService::Operation::PrioritizeAsset));
-  EXPECT_TRUE(platform.deviceService->offers(DovelDeviceService::Operation::CancelAssetTransferForFailedAsset));
+  EXPECT_FALSE(platform.sharedInstance->offers(DovelDeviceService::Operation::PrioritizeAsset));
+  EXPECT_TRUE(platform.sharedInstance->offers(DovelDeviceService::Operation::CancelAssetTransferForFailedAsset));
   EXPECT_FALSE(platform.files->copyItem("/no", "/where", &unchanged));
   EXPECT_EQ(unchanged, std::nullopt) << "a failure that brings no error leaves none of an earlier one";
 }
