@@ -6,7 +6,9 @@
 //
 // Settled here: a member for which no queue is named has a lock of its own; updates of the todo list, and of the
 // restore state file, are made one after the other, so none is lost; an entry of a list that is of an unexpected type
-// is handled as an absent one.
+// is handled as an absent one, be it an application, its store metadata, its icon or an identifier; a list, or an
+// application's store metadata, whose outermost value has to be a dictionary and is none is handled as one that cannot
+// be parsed.
 #pragma once
 
 #include <atomic>
@@ -139,6 +141,8 @@ class AppsClient final : public DovelClient {
   OstrelPromisedTransferToPath _createAppAssetPromiseForBundleIdentifier(
       const std::string& bundleID, const std::optional<std::string>& path,
       const OstrelAppInstallCoordinator& coordinatinator);
+  // Fulfilled from the start: the data of a restored application are on the device already.
+  OstrelPromisedOutOfBandTransfer _userDataPromiseForBundleIdentifier(const std::string& bundleID);
 
   // --- coordination/coordinated_install.cpp -------------------------------------------------------------------------
 
@@ -163,15 +167,54 @@ class AppsClient final : public DovelClient {
   void promiseDidBeginFulfillmentWithIdentifier(std::uint64_t identifier);
   void applicationInstallsDidCancel(const PellumApplicationProxies& applications);
 
+  // --- restore/restore_info.cpp -------------------------------------------------------------------------------------
+
+  // Types 2 and 3 bring back the applications of the restore list, if the backup service agrees; others process
+  // nothing. Blocks for the placeholders, at most 5 seconds for each. Always true, and `error` always overwritten, with
+  // the backup service's or none.
+  bool reconcileRestoreOfType(std::int32_t type, ErrorOut error) override;
+  // Whether the application that was handled last is set up, or there was no list. The list is moved away afterwards.
+  bool _processTarvoRestoreInfo();
+  // The dictionary in the backup service's list of demoted applications; none when there is no such file, it is empty,
+  // or it holds something else. An empty file and a root that is no dictionary leave `error` as it was.
+  static std::optional<PropertyList> _loadDemotedAppsPlist(FileManager& files, const ClientLog& log,
+                                                           const std::string& path, ErrorOut error);
+
+  // --- restore/coordinated_restore.cpp ------------------------------------------------------------------------------
+
+  // Whether the application's coordinator is set up, or the store answers for the application already. `tarvoMetadata`
+  // is a serialised property list, `iconData` an image file; `demotionStatus` is one of "restore/demotion_status.h", any
+  // other value than these is restored as demoted, with a placeholder of a plain restore.
+  bool prepareAppForRestoreUsingCoordination(const std::string& bundleID, BytesView tarvoMetadata,
+                                             std::optional<BytesView> iconData, std::uint64_t demotionStatus);
+  bool _prepareDemotedAppForRestoreWithBundleId(const std::string& bundleID, BytesView tarvoMetadata,
+                                                std::optional<BytesView> iconData, std::uint64_t demotionStatus);
+  bool _prepareNonDemotedAppForRestoreWithBundleId(const std::string& bundleID, BytesView tarvoMetadata,
+                                                   std::optional<BytesView> iconData);
+  // A placeholder that is fully configured; one that could not be has been cancelled.
+  OstrelPlaceholder _placeHolderForBundleIdentifierWithTarvoMetadata(const std::string& bundleID,
+                                                                     const PropertyList& tarvoMetadata,
+                                                                     std::optional<BytesView> iconData,
+                                                                     std::uint64_t demotionStatus);
+
   // --- restore/placeholder_applications.cpp -------------------------------------------------------------------------
 
   std::string placeholderAppPathForBundleIdentifier(const std::string& bundleID);
   bool createPlaceHolderPath(const std::string& path, const std::string& forBundleIdentifier,
                              const FileAttributes& attributes);
-  bool writeIconData(const std::optional<Bytes>& iconData, const std::string& path, std::uint64_t* returningFileSize,
+  bool writeIconData(std::optional<BytesView> iconData, const std::string& path, std::uint64_t* returningFileSize,
                      const std::string& forBundleIdentifier, const FileAttributes& attributes);
   void _enumeratePlaceholdersWithBlock(const PellumApplicationWorkspace::Block& block);
   std::set<std::string> _getSystemAppPlaceholders();
+
+  // --- device/store_accounts.cpp ------------------------------------------------------------------------------------
+
+  std::set<std::string> zelkIDsForAssets() override;
+  // In the registry's order; of several applications of one account the first decides what the account's record says.
+  std::vector<DovelMutableAccountInfo> accountsForAssets() override;
+  std::optional<std::set<std::string>> disabledAssetTypes() override;
+  // A file that is rewritten keeps its format, so that no other value changes.
+  void prepareForBackup() override;
 
   // --- device/home_screen.cpp ---------------------------------------------------------------------------------------
 
@@ -228,6 +271,24 @@ class AppsClient final : public DovelClient {
 
   // coordination/coordinated_transfer.cpp
   OstrelAppInstallCoordinator liveCoordinator(const std::string& bundleID, bool existingApp);
+
+  // restore/restore_info.cpp
+  std::optional<PropertyList> readRestoreInfo();
+  bool restoreApps(const PropertyList& restoreInfo);
+  void waitForPlaceholderInstalls();
+  void moveRestoreListAway();
+
+  // restore/coordinated_restore.cpp
+  struct RestorePreparation;
+  bool setUpDemotedRestore(RestorePreparation& restore);
+  bool setUpRestore(RestorePreparation& restore);
+  std::optional<PropertyList> parseTarvoMetadata(RestorePreparation& restore);
+  bool failForWantOfCoordinator(const RestorePreparation& restore);
+  bool provideUserData(RestorePreparation& restore);
+  bool providePlaceholder(RestorePreparation& restore, const PropertyList& metadata);
+  void giveRestoreUp(const RestorePreparation& restore);
+  bool configureRestorePlaceholder(const std::string& bundleID, const OstrelPlaceholder& placeholder,
+                                   const PropertyList& tarvoMetadata);
 
   // --- members ------------------------------------------------------------------------------------------------------
 

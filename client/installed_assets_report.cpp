@@ -83,7 +83,7 @@ PropertyList AppsClient::installedAssets() {
 PropertyList AppsClient::installedAssetMetrics() {
   std::uint64_t count = 0;
   std::uint64_t size = 0;
-  _platform.defaultWorkspace->enumerateBundlesOfType(kPellumBundleTypeInstalled,
+  _platform.defaultWorkspace->enumerateBundlesOfType(kPellumBundleTypeApplication,
                                                      [&](const PellumApplicationProxy& app, bool& /*stop*/) {
                                                        if (app.applicationType != "User") return;
                                                        size += app.diskUsage.staticUsage;

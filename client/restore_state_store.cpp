@@ -8,9 +8,7 @@ namespace appsync {
 std::optional<PropertyList> AppsClient::readRestoreState(bool& fileIsReadable) {
   const std::optional<Bytes> bytes = _platform.files->readFile(kRestoreStatePath, nullptr);
   fileIsReadable = bytes.has_value();
-  if (!bytes) return std::nullopt;
-  std::optional<PropertyList> root = parsePropertyList(*bytes, nullptr);
-  return root && root->isDictionary() ? root : std::nullopt;
+  return bytes ? parseDictionary(*bytes, nullptr) : std::nullopt;
 }
 
 std::optional<PropertyList> AppsClient::_restoreStatePropertyForKey(const std::string& key,

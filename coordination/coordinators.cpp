@@ -95,4 +95,12 @@ OstrelPromisedTransferToPath AppsClient::_createAppAssetPromiseForBundleIdentifi
   return promise;
 }
 
+OstrelPromisedOutOfBandTransfer AppsClient::_userDataPromiseForBundleIdentifier(const std::string& bundleID) {
+  const auto promise = OstrelPromisedOutOfBandTransfer::initWithName(*_platform.coordination, bundleID + "-UserData",
+                                                                     OstrelClientDovel, 0);
+  promise.setPercentComplete(1.0);
+  promise.setComplete(true);
+  return promise;
+}
+
 }  // namespace appsync

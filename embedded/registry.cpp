@@ -55,12 +55,18 @@ PropertyList placeholderInfo(const PlaceholderDescription& description) {
   return info;
 }
 
-bool belongsTo(std::uint64_t bundleType, const PellumApplicationProxy& record) {
+bool isRestored(const PellumApplicationProxy& record) {
+  return record.installType == kPellumInstallTypeRestore || record.installType == kPellumInstallTypeDowngrade ||
+         record.installType == kPellumInstallTypeIntentionalDowngrade;
+}
+
+// `isAlone`: the application has no other record.
+bool belongsTo(std::uint64_t bundleType, const PellumApplicationProxy& record, bool isAlone) {
   switch (bundleType) {
     case kPellumBundleTypeAll:
       return true;
-    case kPellumBundleTypeInstalled:
-      return record.isInstalled();
+    case kPellumBundleTypeApplication:
+      return record.isInstalled() || (isAlone && isRestored(record));
     case kPellumBundleTypeSystem:
       return record.applicationType == "System";
     default:
@@ -113,10 +119,12 @@ void EmbeddedRegistry::enumerateBundlesOfType(std::uint64_t type, const Block& b
   PellumApplicationProxies records;
   {
     const MutexLock lock(_mutex);
-    for (const auto& [bundleID, record] : _applications) records.push_back(record.proxy());
-    for (const auto& [bundleID, record] : _placeholders) records.push_back(proxy(record));
+    const auto add = [&](const PellumApplicationProxy& record, bool isAlone) {
+      if (belongsTo(type, record, isAlone)) records.push_back(record);
+    };
+    for (const auto& [bundleID, record] : _applications) add(record.proxy(), !_placeholders.contains(bundleID));
+    for (const auto& [bundleID, record] : _placeholders) add(proxy(record), !_applications.contains(bundleID));
   }
-  std::erase_if(records, [&](const PellumApplicationProxy& record) { return !belongsTo(type, record); });
   std::stable_sort(records.begin(), records.end(),
                    [](const auto& a, const auto& b) { return a.bundleIdentifier < b.bundleIdentifier; });
   bool stop = false;

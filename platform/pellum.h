@@ -26,9 +26,11 @@ inline constexpr std::uint64_t kPellumInstallPhaseLoading = 0;
 inline constexpr std::uint64_t kPellumInstallPhaseInstalling = 1;
 
 // Classes of registry records to walk.
-inline constexpr std::uint64_t kPellumBundleTypeAll = 0;        // every application and placeholder
-inline constexpr std::uint64_t kPellumBundleTypeInstalled = 1;  // installed applications, no placeholders
-inline constexpr std::uint64_t kPellumBundleTypeSystem = 7;     // records of application type "System"
+inline constexpr std::uint64_t kPellumBundleTypeAll = 0;  // every application and placeholder
+// What a person would call an application of the device: what is installed, and what a restore has brought back and
+// still stands there as a placeholder alone. One record for each identifier.
+inline constexpr std::uint64_t kPellumBundleTypeApplication = 1;
+inline constexpr std::uint64_t kPellumBundleTypeSystem = 7;  // records of application type "System"
 
 // The progress of an install, as it was when the record was read.
 struct PellumInstallProgress {

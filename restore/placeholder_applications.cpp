@@ -23,7 +23,7 @@ bool AppsClient::createPlaceHolderPath(const std::string& path, const std::strin
   return created;
 }
 
-bool AppsClient::writeIconData(const std::optional<Bytes>& iconData, const std::string& path,
+bool AppsClient::writeIconData(std::optional<BytesView> iconData, const std::string& path,
                                std::uint64_t* returningFileSize, const std::string& forBundleIdentifier,
                                const FileAttributes& attributes) {
   if (!iconData) {
