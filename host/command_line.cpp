@@ -14,6 +14,8 @@ namespace {
 // A place to parse into, for each command.
 struct Everything {
   SyncOptions sync;
+  RestoreOptions restore;
+  BackupOptions backup;
   StatusOptions status;
   ClearOptions clear;
   SettingsOptions settings;
@@ -30,6 +32,11 @@ std::string isWholeNumber(const std::string& text) {
   return isOne ? "" : "\"" + text + "\" is no whole number";
 }
 
+std::string isInteger(const std::string& text) {
+  const bool isOne = isWholeNumber(text.starts_with('-') ? text.substr(1) : text).empty();
+  return isOne ? "" : "\"" + text + "\" is no integer";
+}
+
 class Grammar {
  public:
   Grammar() : _app("Syncs applications to a device that lives in a directory.", "dovel") {
@@ -38,6 +45,7 @@ class Grammar {
     _app.require_subcommand(1);
     _app.footer("\"dovel COMMAND --help\" tells more of a command.");
     addSync();
+    addRestore();
     addDeviceCommands();
     addPlist();
     addSample();
@@ -115,8 +123,26 @@ class Grammar {
     repeatable(command->add_option("--prioritize", sync.prioritize, "Ask for this application first"))->type_name("ID");
   }
 
+  void addRestore() {
+    RestoreOptions& restore = _parsed.restore;
+    CLI::App* command = add(
+        "restore", "Bring the applications of a backup back as placeholders",
+        [&restore](Console& console) { return runRestore(restore, console); }, &restore.common);
+    command->add_option("BACKUP", restore.backup, "The backup directory")->required();
+    command->add_option("--type", restore.type, "The type of the restore (default 2)")
+        ->check(isInteger)
+        ->type_name("N");
+    command
+        ->add_option("--host-process", restore.hostProcess,
+                     "The process that hosts the client (default com.zelk.datamigrator)")
+        ->type_name("ID");
+  }
+
   void addDeviceCommands() {
     Everything& all = _parsed;
+    add(
+        "backup", "Tidy store metadata before a backup; report the store accounts",
+        [&all](Console& console) { return runBackup(all.backup, console); }, &all.backup.common);
     add(
         "status", "Show what is on the device", [&all](Console& console) { return runStatus(all.status, console); },
         &all.status.common);

@@ -7,6 +7,8 @@
 namespace appsync {
 
 int runSync(const SyncOptions& options, Console& console);
+int runRestore(const RestoreOptions& options, Console& console);
+int runBackup(const BackupOptions& options, Console& console);
 int runStatus(const StatusOptions& options, Console& console);
 int runClear(const ClearOptions& options, Console& console);
 int runSettings(const SettingsOptions& options, Console& console);

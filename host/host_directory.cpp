@@ -18,97 +18,8 @@ namespace {
 constexpr char kIncoming[] = "/var/mobile/Media/PublicStaging/.ApplicationSync.incoming";
 constexpr char kLastSyncDirectory[] = "/var/mobile/Library/ApplicationSync";
 constexpr char kLastSyncList[] = "LastSyncAppState.plist";
-constexpr std::size_t kDeepest = 32;  // directories within directories
-
-// A plain file below a directory. None, with errno, for everything else.
-OwnedFile openPlainFile(int directory, const std::string& name, struct stat& information) {
-  OwnedFile file(::openat(directory, name.c_str(), O_RDONLY | O_NOFOLLOW | O_CLOEXEC | O_NONBLOCK));
-  if (!file) return {};
-  if (::fstat(file.get(), &information) != 0) return {};
-  if (S_ISREG(information.st_mode)) return file;
-  errno = S_ISDIR(information.st_mode) ? EISDIR : EINVAL;
-  return {};
-}
 
 }  // namespace
-
-// Copies from the host to the device until something fails.
-class HostDirectory::Copier {
- public:
-  Copier(std::string host, EmbeddedFileManager& files, const Supervision& supervision, Failure& failure)
-      : _host(std::move(host)), _files(files), _supervision(supervision), _failure(failure), _piece(kPieceSize) {}
-
-  bool copyDirectory(const OwnedFile& source, const std::string& name, const std::string& target, std::size_t depth) {
-    std::optional<Error> error;
-    if (!_files.createDirectory(target, true, {}, &error)) return deviceFailed(*error);
-    std::vector<std::string> names;
-    if (!listDirectory(source.get(), names)) return hostFailed(name, errno);
-    for (const std::string& one : names) {
-      if (!copyItem(source, one, name + "/" + one, target + "/" + one, depth)) return false;
-    }
-    return true;
-  }
-
-  // `name` is what messages call it.
-  bool copyFile(int directory, const std::string& leaf, const std::string& name, const std::string& target) {
-    struct stat information {};
-    const OwnedFile source = openPlainFile(directory, leaf, information);
-    if (!source) return hostFailed(name, errno);
-    std::optional<Error> error;
-    const auto sink = _files.openSink(target, &error);
-    if (!sink) return deviceFailed(*error);
-    while (true) {
-      if (_supervision.isStopped()) return false;
-      const ssize_t count = ::read(source.get(), _piece.data(), _piece.size());
-      if (count < 0 && errno == EINTR) continue;
-      if (count < 0) return hostFailed(name, errno);
-      if (count == 0) break;
-      if (!sink->append(_piece.data(), static_cast<std::size_t>(count), &error)) return deviceFailed(*error);
-    }
-    return sink->finish(&error) || deviceFailed(*error);
-  }
-
- private:
-  bool copyItem(const OwnedFile& directory, const std::string& leaf, const std::string& name, const std::string& target,
-                std::size_t depth) {
-    struct stat information {};
-    if (::fstatat(directory.get(), leaf.c_str(), &information, AT_SYMLINK_NOFOLLOW) != 0) {
-      return hostFailed(name, errno);
-    }
-    if (S_ISREG(information.st_mode)) return copyFile(directory.get(), leaf, name, target);
-    if (!S_ISDIR(information.st_mode)) {
-      _supervision.note("\"" + name + "\" is neither a plain file nor a directory and is left out");
-      return true;
-    }
-    if (depth == kDeepest) {
-      _supervision.note("\"" + name + "\" lies deeper than " + std::to_string(kDeepest) +
-                        " directories and is left out");
-      return true;
-    }
-    Disk disk;
-    const OwnedFile inside = openDirectoryAt(disk, directory.get(), leaf);
-    if (!inside) return hostFailed(name, errno);
-    return copyDirectory(inside, name, target, depth + 1);
-  }
-
-  bool hostFailed(const std::string& name, int errorNumber) {
-    _failure = {FailureCode::HostUnusable,
-                "\"" + _host + "/" + name + "\" cannot be read: " + std::strerror(errorNumber),
-                "make it readable, or take it out of the host directory"};
-    return false;
-  }
-
-  bool deviceFailed(const Error& error) {
-    _failure = {FailureCode::DeviceUnusable, error.text(), "make room on the device's disk, and it writable"};
-    return false;
-  }
-
-  const std::string _host;
-  EmbeddedFileManager& _files;
-  const Supervision& _supervision;
-  Failure& _failure;
-  std::vector<char> _piece;
-};
 
 std::optional<HostDirectory> HostDirectory::open(const std::string& path, Failure& failure) {
   OwnedFile directory(::open(path.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
@@ -118,8 +29,8 @@ std::optional<HostDirectory> HostDirectory::open(const std::string& path, Failur
   return std::nullopt;
 }
 
-bool HostDirectory::push(EmbeddedFileManager& files, const Supervision& supervision, Failure& failure) const {
-  Copier copier(_path, files, supervision, failure);
+bool HostDirectory::push(EmbeddedFileManager& files, const CopySupervision& supervision, Failure& failure) const {
+  DeviceCopier copier(_path, files, supervision, failure);
   std::optional<Error> error;
   struct stat information {};
   const auto has = [&](const char* name, mode_t kind) {
@@ -133,7 +44,7 @@ bool HostDirectory::push(EmbeddedFileManager& files, const Supervision& supervis
   if (has("ApplicationSync", S_IFDIR)) {
     Disk disk;
     const OwnedFile source = openDirectoryAt(disk, _directory->get(), "ApplicationSync");
-    bool done = copier.copyDirectory(source, "ApplicationSync", kIncoming, 1);
+    bool done = copier.copyDirectory(source, "ApplicationSync", kIncoming);
     if (done && !files.moveItem(kIncoming, kStagedSync, &error)) {
       failure = {FailureCode::DeviceUnusable, error->text(), "make the device's directory writable"};
       done = false;
@@ -148,8 +59,7 @@ bool HostDirectory::push(EmbeddedFileManager& files, const Supervision& supervis
     failure = {FailureCode::DeviceUnusable, error->text(), "make the device's directory writable"};
     return false;
   }
-  return copier.copyFile(_directory->get(), kLastSyncList, kLastSyncList,
-                         std::string(kLastSyncDirectory) + "/" + kLastSyncList);
+  return copier.copyFile(_directory->get(), kLastSyncList, std::string(kLastSyncDirectory) + "/" + kLastSyncList);
 }
 
 OwnedFile HostDirectory::openPackage(const std::string& identifier, std::uint64_t& size, ErrorOut error) const {

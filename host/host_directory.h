@@ -1,9 +1,7 @@
 // The desktop host's directory: what it has for the device. Only read, never changed; links in it are not followed.
 #pragma once
 
-#include <cstddef>
 #include <cstdint>
-#include <functional>
 #include <memory>
 #include <optional>
 #include <string>
@@ -11,6 +9,7 @@
 
 #include "embedded/disk.h"
 #include "embedded/file_manager.h"
+#include "host/device_copier.h"
 #include "host/failure.h"
 
 namespace appsync {
@@ -18,29 +17,21 @@ namespace appsync {
 inline constexpr char kStagingDirectory[] = "/var/mobile/Media/PublicStaging";
 inline constexpr char kStagedSync[] = "/var/mobile/Media/PublicStaging/ApplicationSync";
 inline constexpr char kPackageDirectory[] = "/var/mobile/Media/PublicStaging/Packages";
-inline constexpr std::size_t kPieceSize = std::size_t{1} << 20;  // bytes read and written at a time
 
 class HostDirectory {
  public:
   // None, with the failure said, when there is no such directory.
   static std::optional<HostDirectory> open(const std::string& path, Failure& failure);
 
-  // Hears of what is left out, one line each, and is asked between pieces whether to stop.
-  struct Supervision {
-    std::function<void(const std::string& line)> note;
-    std::function<bool()> isStopped;
-  };
-
   // Puts a copy of "ApplicationSync" into the staging area, in one step once it is whole, and the last-sync list to its
   // place. What the host does not have is left out. False, with the failure said, when something cannot be read or
   // written (then nothing is staged), or when it was stopped (then the failure stays untouched).
-  bool push(EmbeddedFileManager& files, const Supervision& supervision, Failure& failure) const;
+  bool push(EmbeddedFileManager& files, const CopySupervision& supervision, Failure& failure) const;
 
   // A package, open for reading. None, with an error of the domain "TransferError", when the host does not have it.
   OwnedFile openPackage(const std::string& identifier, std::uint64_t& size, ErrorOut error) const;
 
  private:
-  class Copier;
   HostDirectory(std::string path, std::shared_ptr<OwnedFile> directory)
       : _path(std::move(path)), _directory(std::move(directory)) {}
 

@@ -23,17 +23,20 @@ const char* nameOf(const CoordinatorEvent& event) {
 
 }  // namespace
 
+void traceEvent(TraceFile* trace, const CoordinatorEvent& event) {
+  if (trace == nullptr) return;
+  Json details = Json::object();
+  if (event.error) details["error"] = reasonText(*event.error);
+  trace->moment(event.bundleID, nameOf(event), details);
+}
+
 void InstallWatch::begin(const std::vector<std::string>& identifiers) {
   MutexLock lock(_mutex);
   _watched.insert(identifiers.begin(), identifiers.end());
 }
 
 void InstallWatch::hear(const CoordinatorEvent& event) {
-  if (_trace != nullptr) {
-    Json details = Json::object();
-    if (event.error) details["error"] = reasonText(*event.error);
-    _trace->moment(event.bundleID, nameOf(event), details);
-  }
+  traceEvent(_trace, event);
   if (event.kind == CoordinatorEvent::Kind::PlaceholderInstalled) return;
   {
     MutexLock lock(_mutex);

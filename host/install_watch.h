@@ -14,6 +14,9 @@
 
 namespace appsync {
 
+// Shows an event on its application's track. `trace` may be null.
+void traceEvent(TraceFile* trace, const CoordinatorEvent& event);
+
 // Any thread.
 class InstallWatch {
  public:

@@ -6,7 +6,6 @@
 #include <cstdint>
 #include <cstdio>
 #include <limits>
-#include <span>
 #include <vector>
 
 namespace appsync {
@@ -295,6 +294,17 @@ Json jsonFromPropertyList(const PropertyList& value) {
 void writePropertyListAsJson(const PropertyList& value, const std::function<void(std::string_view)>& write) {
   JsonTreeWriter(write).value(value, 0);
   write("\n");
+}
+
+Json accountDocuments(std::vector<DovelMutableAccountInfo> accounts) {
+  std::sort(accounts.begin(), accounts.end(), [](const auto& a, const auto& b) { return a.zelkID() < b.zelkID(); });
+  Json documents = Json::array();
+  for (const DovelMutableAccountInfo& account : accounts) {
+    documents.push_back({{"zelkID", account.zelkID() ? Json(*account.zelkID()) : Json(nullptr)},
+                         {"qenID", account.qenID() ? jsonFromPropertyList(*account.qenID()) : Json(nullptr)},
+                         {"altQenID", account.altQenID() ? Json(*account.altQenID()) : Json(nullptr)}});
+  }
+  return documents;
 }
 
 std::optional<std::string> isoDateText(double secondsSince2001) {

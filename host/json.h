@@ -10,8 +10,10 @@
 #include <optional>
 #include <string>
 #include <string_view>
+#include <vector>
 
 #include "host/json_forward.h"
+#include "platform/dovel_client.h"
 #include "platform/error.h"
 #include "platform/property_list.h"
 
@@ -34,6 +36,9 @@ Json jsonFromPropertyList(const PropertyList& value);
 
 // Writes a property list as indented JSON, piece by piece: it may be much larger written out than it is in memory.
 void writePropertyListAsJson(const PropertyList& value, const std::function<void(std::string_view)>& write);
+
+// Store accounts in the order of their ids, an object each; absent values are null.
+Json accountDocuments(std::vector<DovelMutableAccountInfo> accounts);
 
 // "2026-01-31T12:00:00Z"; none outside the years 1 to 9999.
 std::optional<std::string> isoDateText(double secondsSince2001);

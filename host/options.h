@@ -30,6 +30,17 @@ struct SyncOptions {
   std::vector<std::string> prioritize;
 };
 
+struct RestoreOptions {
+  DeviceOptionsGiven common;
+  std::string backup;
+  std::int32_t type = 2;
+  std::string hostProcess = "com.zelk.datamigrator";
+};
+
+struct BackupOptions {
+  DeviceOptionsGiven common;
+};
+
 struct StatusOptions {
   DeviceOptionsGiven common;
 };

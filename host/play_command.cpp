@@ -139,7 +139,7 @@ class PlayRun {
     }
     if (action == "outstandingAssetTransfers") return outstandingAssetTransfers();
     if (action == "zelkIDsForAssets") return arrayOf(client.zelkIDsForAssets());
-    if (action == "accountsForAssets") return accountsForAssets();
+    if (action == "accountsForAssets") return accountDocuments(client.accountsForAssets());
     if (action == "disabledAssetTypes") {
       const auto types = client.disabledAssetTypes();
       return types ? arrayOf(*types) : Json(nullptr);
@@ -178,16 +178,6 @@ class PlayRun {
     }
     _session.device().deviceService().setQueue(queue);
     return assets;
-  }
-
-  Json accountsForAssets() {
-    Json accounts = Json::array();
-    for (const DovelMutableAccountInfo& account : _session.client().accountsForAssets()) {
-      accounts.push_back({{"zelkID", account.zelkID() ? Json(*account.zelkID()) : Json(nullptr)},
-                          {"qenID", account.qenID() ? jsonFromPropertyList(*account.qenID()) : Json(nullptr)},
-                          {"altQenID", account.altQenID() ? Json(*account.altQenID()) : Json(nullptr)}});
-    }
-    return accounts;
   }
 
   void deliver(const std::string& action, const Json& arguments) {
@@ -249,8 +239,8 @@ class PlayRun {
     if (!host) return false;
     EmbeddedFileManager& files = _session.device().files();
     clearStaging(files, _session.device().coordination().packagePathsInUse());
-    const HostDirectory::Supervision supervision{[this](const std::string& line) { _console.problem(line); },
-                                                 [this] { return _session.interrupt().signal() != 0; }};
+    const CopySupervision supervision{[this](const std::string& line) { _console.problem(line); },
+                                      [this] { return _session.interrupt().signal() != 0; }};
     return host->push(files, supervision, failure) || _session.interrupt().signal() != 0;
   }
 

@@ -3,6 +3,8 @@
 #include <algorithm>
 #include <cmath>
 #include <cstdint>
+#include <cstdlib>
+#include <string_view>
 
 #include "host/text.h"
 
@@ -15,6 +17,11 @@ constexpr double kTransferShare = 0.9;  // of a bar; it is full only when the ap
 constexpr std::size_t kStateWidth = 17;
 
 }  // namespace
+
+bool canDrawInPlace(const DeviceOptionsGiven& options, const Console& console) {
+  const char* terminal = std::getenv("TERM");
+  return console.isTerminal() && options.log != "-" && terminal != nullptr && std::string_view(terminal) != "dumb";
+}
 
 ProgressDisplay::ProgressDisplay(Console& console, bool drawsInPlace)
     : _console(console), _drawsInPlace(drawsInPlace) {}

@@ -11,9 +11,13 @@
 #include <vector>
 
 #include "host/console.h"
+#include "host/options.h"
 #include "platform/thread_annotations.h"
 
 namespace appsync {
+
+// Whether a picture may be drawn over an earlier one: a person looks at a terminal that nothing else writes to.
+bool canDrawInPlace(const DeviceOptionsGiven& options, const Console& console);
 
 // Any thread. Applications that `begin` has not named are ignored.
 class ProgressDisplay {

@@ -64,6 +64,13 @@ std::string cell(const Json& value) {
   return printable(value.is_string() ? value.get<std::string>() : jsonLine(value));
 }
 
+std::string cell(const Json& entry, const char* field) {
+  const Json& value = entry[field];
+  return std::string_view(field) == "installType" && value.is_number_integer()
+             ? installTypeText(value.get<std::uint64_t>())
+             : cell(value);
+}
+
 // A table with a headline; its columns are as wide as their widest cell.
 void printTable(const Json& document, const Listing& listing, Console& console) {
   const Json& entries = document[listing.key];
@@ -72,7 +79,7 @@ void printTable(const Json& document, const Listing& listing, Console& console) 
   for (const char* field : listing.fields) {
     std::size_t width = std::string_view(field).size();
     for (const Json& entry : entries)
-      width = std::max(width, std::min<std::size_t>(displayWidth(cell(entry[field])), 48));
+      width = std::max(width, std::min<std::size_t>(displayWidth(cell(entry, field)), 48));
     widths.push_back(width);
   }
   const auto printRow = [&](const auto& cellOf) {
@@ -83,7 +90,7 @@ void printTable(const Json& document, const Listing& listing, Console& console) 
   };
   if (!entries.empty()) printRow([](const char* field) { return std::string(field); });
   for (const Json& entry : entries) {
-    printRow([&](const char* field) { return cell(entry[field]); });
+    printRow([&](const char* field) { return cell(entry, field); });
   }
 }
 

@@ -2,7 +2,6 @@
 #include <algorithm>
 #include <chrono>
 #include <set>
-#include <string_view>
 
 #include "embedded/coordination.h"
 #include "embedded/file_manager.h"
@@ -25,12 +24,6 @@ constexpr char kTodoList[] = "/var/mobile/Library/ApplicationSync/TarvoStuff/App
 constexpr char kAnchor[] = "dovel";
 constexpr auto kPatienceWithInstalls = std::chrono::seconds(30);  // without any progress
 
-bool drawsInPlace(const SyncOptions& options, const Console& console) {
-  const char* terminal = std::getenv("TERM");
-  return console.isTerminal() && options.common.log != "-" && terminal != nullptr &&
-         std::string_view(terminal) != "dumb";
-}
-
 class SyncRun {
  public:
   SyncRun(const SyncOptions& options, const HostDirectory& host, Session& session, const SyncLog& log, Console& console)
@@ -40,7 +33,7 @@ class SyncRun {
         _device(session.device()),
         _log(log),
         _console(console),
-        _display(console, drawsInPlace(options, console)),
+        _display(console, canDrawInPlace(options.common, console)),
         _watch(_display, session.trace()) {}
 
   ~SyncRun() {
@@ -89,8 +82,8 @@ class SyncRun {
   bool pushHost(Failure& failure) {
     for (const std::string& line : _device.repairs()) _console.problem(line);
     clearStaging(_device.files(), _device.coordination().packagePathsInUse());
-    const HostDirectory::Supervision supervision{[this](const std::string& line) { _console.problem(line); },
-                                                 [this] { return isInterrupted(); }};
+    const CopySupervision supervision{[this](const std::string& line) { _console.problem(line); },
+                                      [this] { return isInterrupted(); }};
     return _host.push(_device.files(), supervision, failure);
   }
 

@@ -31,11 +31,6 @@ constexpr std::string_view kRemoved =
 constexpr std::string_view kPrepared =
     "processing app install for bundle %{public}@ finished with status %d error %{public}@";
 
-std::string_view withoutPrefix(std::string_view message) {
-  const std::size_t bar = message.find('|');
-  return bar == std::string_view::npos ? message : message.substr(bar + 1);
-}
-
 // The elements of a list as a line shows it: "[a, b]", its end cut off with "…" when it is long.
 std::vector<std::string> listElements(std::string_view text) {
   std::vector<std::string> elements;
@@ -119,6 +114,11 @@ std::optional<std::string> SyncLog::preparationError(const std::string& identifi
   const auto found = _preparationErrors.find(identifier);
   if (found == _preparationErrors.end() || found->second == "(null)") return std::nullopt;
   return found->second;
+}
+
+std::string_view withoutPrefix(std::string_view message) {
+  const std::size_t bar = message.find('|');
+  return bar == std::string_view::npos ? message : message.substr(bar + 1);
 }
 
 std::optional<std::vector<std::string>> argumentsOfLine(std::string_view format, std::string_view message) {

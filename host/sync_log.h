@@ -47,6 +47,9 @@ class SyncLog : public LogSink {
   std::map<std::string, std::string> _preparationErrors APPSYNC_GUARDED_BY(_mutex);
 };
 
+// A line's message without the plug-in's identifier and bar in front of it.
+std::string_view withoutPrefix(std::string_view message);
+
 // The arguments of a line, found by laying its format over its message (without the prefix). None when they do not fit.
 std::optional<std::vector<std::string>> argumentsOfLine(std::string_view format, std::string_view message);
 

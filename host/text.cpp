@@ -136,4 +136,12 @@ std::string byteText(double bytes) {
   return text.data();
 }
 
+std::string installTypeText(std::uint64_t type) {
+  constexpr std::array<const char*, 9> kNames{
+      "none",      "store download",       "restore", "automatic download", "sync", "automatic update", "migration",
+      "downgrade", "intentional downgrade"};
+  const std::string number = std::to_string(type);
+  return type < kNames.size() ? std::string(kNames[type]) + " (" + number + ")" : number;
+}
+
 }  // namespace appsync

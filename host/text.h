@@ -2,6 +2,7 @@
 #pragma once
 
 #include <cstddef>
+#include <cstdint>
 #include <string>
 #include <string_view>
 
@@ -22,5 +23,8 @@ std::string counted(std::size_t number, std::string_view one, std::string_view m
 
 // "712 B", "4.2 MiB".
 std::string byteText(double bytes);
+
+// The registry's install type with its name: "restore (2)"; a number without a name by itself.
+std::string installTypeText(std::uint64_t type);
 
 }  // namespace appsync

@@ -1,0 +1,39 @@
+// A backup: what a restore leaves on the device before the client is asked to bring the applications back. Only read,
+// never changed; links in it are not followed.
+#pragma once
+
+#include <memory>
+#include <optional>
+#include <string>
+
+#include "embedded/disk.h"
+#include "embedded/file_manager.h"
+#include "host/device_copier.h"
+#include "host/failure.h"
+
+namespace appsync {
+
+inline constexpr char kBackupRestoreList[] = "RestoreApplications.plist";
+inline constexpr char kBackupDemotedApps[] = "com.zelk.Vaultry.DemotedApps.plist";
+
+class BackupDirectory {
+ public:
+  // None, with the failure said, when there is no such directory.
+  static std::optional<BackupDirectory> open(const std::string& path, Failure& failure);
+
+  // Puts a copy of its lists in place on the device; what the backup lacks is not there afterwards either. False, with
+  // the failure said, when something cannot be read or written, or when it was stopped (then the failure stays
+  // untouched).
+  bool push(EmbeddedFileManager& files, const CopySupervision& supervision, Failure& failure) const;
+
+  const std::string& path() const { return _path; }
+
+ private:
+  BackupDirectory(std::string path, std::shared_ptr<OwnedFile> directory)
+      : _path(std::move(path)), _directory(std::move(directory)) {}
+
+  std::string _path;
+  std::shared_ptr<OwnedFile> _directory;
+};
+
+}  // namespace appsync
