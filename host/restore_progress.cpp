@@ -200,7 +200,7 @@ std::string RestoreProgress::waitText() const {
   const std::string most = ", at most " + std::to_string(left.count()) + " s";
   const std::string what =
       "waiting for " + counted(static_cast<std::size_t>(_awaited), "placeholder", "placeholders") + most;
-  if (pending.empty()) return what + ": all are installed, but the client has not heard of each";
+  if (pending.empty()) return what + ": all are installed, but the client has not heard of it";
   std::string names;
   for (std::size_t i = 0; i < std::min(pending.size(), kNamesShown); ++i) names += (i > 0 ? ", " : "") + pending[i];
   if (pending.size() > kNamesShown) names += " and " + std::to_string(pending.size() - kNamesShown) + " more";
@@ -210,7 +210,10 @@ std::string RestoreProgress::waitText() const {
 void RestoreProgress::drawWait() {
   MutexLock lock(_mutex);
   while (_isWaiting) {
-    _console.raw("\r\x1b[K" + fitted(waitText(), _console.columns() - 1));
+    std::string text = waitText();
+    const std::size_t room = _console.columns() - 4;  // the terminal shows "^C" behind it
+    if (displayWidth(text) > room) text = fitted(text, room);
+    _console.raw("\r\x1b[K" + text);
     _isDrawn = true;
     _changed.wait_for(lock.native(), std::chrono::seconds(1),
                       [this]() APPSYNC_NO_THREAD_ANALYSIS { return !_isWaiting || !_isDrawn; });
