@@ -4,6 +4,9 @@
 set(APPSYNC_WARNINGS -Wall -Wextra -Wpedantic -Wconversion -Wshadow -Werror)
 if(CMAKE_CXX_COMPILER_ID STREQUAL "Clang")
   list(APPEND APPSYNC_WARNINGS -Wthread-safety)
+elseif(NOT CMAKE_BUILD_TYPE STREQUAL "Debug")
+  # What GCC 12 says here of optimised code is wrong: of a literal before a string, of an empty optional.
+  list(APPEND APPSYNC_WARNINGS -Wno-restrict -Wno-maybe-uninitialized)
 endif()
 add_compile_options(${APPSYNC_WARNINGS})
 if(APPSYNC_SANITIZE)

@@ -1,0 +1,111 @@
+// A restore of many applications with icons of 20 KiB each, on an embedded device in the temporary directory.
+//
+// Counters, for one application of the list: `user_us` and `system_us`, the time of the client's thread in its own code
+// and in the kernel (each placeholder's files are flushed), without the wait; `icon_blocks`, how many blocks of memory
+// that could hold an icon it takes: one for the list's value, one for the service's own copy.
+#include <benchmark/benchmark.h>
+#include <sys/resource.h>
+
+#include <cstdlib>
+#include <filesystem>
+#include <new>
+
+#include "client/apps_client.h"
+#include "embedded/coordination.h"
+#include "embedded/device.h"
+#include "embedded/file_manager.h"
+#include "embedded/waiting.h"
+
+namespace {
+
+constexpr std::size_t kIconSize = 20 * 1024;
+constexpr std::size_t kLargestIconBlock = kIconSize + 4096;
+
+thread_local std::int64_t iconBlocks = 0;
+
+}  // namespace
+
+void* operator new(std::size_t size) {
+  if (size >= kIconSize && size <= kLargestIconBlock) ++iconBlocks;
+  void* memory = std::malloc(size);
+  if (memory == nullptr) throw std::bad_alloc();
+  return memory;
+}
+void operator delete(void* memory) noexcept {
+  std::free(memory);
+}
+void operator delete(void* memory, std::size_t /*size*/) noexcept {
+  std::free(memory);
+}
+
+namespace {
+
+using namespace appsync;
+
+constexpr char kRestoreList[] = "/var/mobile/Media/TarvoRestore/RestoreApplications.plist";
+constexpr char kDemotedApps[] = "/var/mobile/Library/Preferences/com.zelk.Vaultry.DemotedApps.plist";
+
+void putLists(FileManager& files, std::int64_t count) {
+  const Bytes metadata =
+      *serializePropertyList(PropertyList::dictionary({{"title", "Application"}, {"bundleVersion", "1.0"}}),
+                             PropertyListFormat::Binary, nullptr);
+  PropertyList list = PropertyList::dictionary();
+  PropertyList demoted = PropertyList::array();
+  for (std::int64_t i = 0; i < count; ++i) {
+    const std::string bundleID = "org.sample.application" + std::to_string(i);
+    list.set(bundleID,
+             PropertyList::dictionary({{"TarvoMetadata", PropertyList::data(metadata)},
+                                       {"PlaceholderIcon", PropertyList::data(Bytes(kIconSize, std::uint8_t(i)))}}));
+    if (i % 2 == 0) demoted.append(bundleID);
+  }
+  files.writeFile(kRestoreList, *serializePropertyList(list, PropertyListFormat::Binary, nullptr), nullptr);
+  files.writeFile(kDemotedApps,
+                  *serializePropertyList(PropertyList::dictionary({{"AutomaticDowngrades", demoted}}),
+                                         PropertyListFormat::Binary, nullptr),
+                  nullptr);
+}
+
+double microseconds(const timeval& time) {
+  return 1e6 * static_cast<double>(time.tv_sec) + static_cast<double>(time.tv_usec);
+}
+
+void restore(benchmark::State& state) {
+  const std::int64_t count = state.range(0);
+  double user = 0;
+  double system = 0;
+  std::int64_t blocks = 0;
+  for (auto _ : state) {
+    state.PauseTiming();
+    std::string directory = (std::filesystem::temp_directory_path() / "appsync-bench-XXXXXX").string();
+    if (::mkdtemp(directory.data()) == nullptr) return state.SkipWithError("no temporary directory");
+    const auto device = Device::open({.directory = directory}, nullptr);
+    if (!device) return state.SkipWithError("no device");
+    putLists(device->files(), count);
+    auto client = std::make_unique<AppsClient>(device->platform());
+    device->waiting().interrupt();  // only the work counts, not the wait
+    iconBlocks = 0;
+    rusage before{};
+    rusage after{};
+    ::getrusage(RUSAGE_THREAD, &before);
+    state.ResumeTiming();
+    const bool isRestored = client->_processTarvoRestoreInfo();
+    state.PauseTiming();
+    ::getrusage(RUSAGE_THREAD, &after);
+    if (!isRestored) state.SkipWithError("an application was not restored");
+    user += microseconds(after.ru_utime) - microseconds(before.ru_utime);
+    system += microseconds(after.ru_stime) - microseconds(before.ru_stime);
+    blocks += iconBlocks;
+    client.reset();
+    device->drain();
+    std::filesystem::remove_all(directory);
+    state.ResumeTiming();
+  }
+  const auto applications = static_cast<double>(count * state.iterations());
+  state.counters["user_us"] = user / applications;
+  state.counters["system_us"] = system / applications;
+  state.counters["icon_blocks"] = static_cast<double>(blocks) / applications;
+}
+
+BENCHMARK(restore)->Arg(250)->Arg(500)->Arg(1000)->Arg(2000)->Iterations(1)->Unit(benchmark::kMillisecond);
+
+}  // namespace
