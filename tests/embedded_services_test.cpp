@@ -1,0 +1,508 @@
+// The small services of the embedded device: what they refuse, what they keep, and what they do when the disk fails.
+#include <gtest/gtest.h>
+
+#include <cerrno>
+#include <set>
+#include <string>
+#include <utility>
+#include <vector>
+
+#include "embedded/device.h"
+#include "embedded/icons.h"
+#include "embedded/notifications.h"
+#include "embedded/settings.h"
+#include "tests/support/registry_device.h"
+#include "tests/support/world.h"
+
+namespace appsync {
+namespace {
+
+using test::plist;
+using test::RegistryDevice;
+
+void put(RegistryDevice& device, const std::string& path, const std::string& content) {
+  device.files->createDirectory(path.substr(0, path.rfind('/')), true, {}, nullptr);
+  ASSERT_TRUE(device.files->writeFile(path, Bytes(content.begin(), content.end()), nullptr));
+}
+
+void seed(RegistryDevice& device, const std::string& installed, const std::string& placeholders) {
+  std::optional<Error> error;
+  ASSERT_TRUE(seedPlaceholders(*device.registry, plist(placeholders), &error)) << error->description();
+  ASSERT_TRUE(seedInstalled(*device.registry, *device.files, plist(installed), &error)) << error->description();
+}
+
+// --- records --------------------------------------------------------------------------------------------------------
+
+TEST(StateStore, RefusesNamesThatLeadElsewhere) {
+  RegistryDevice device;
+  ASSERT_TRUE(device.store->save("apps/org.a", "kept", nullptr));
+  for (const std::string& name : {std::string("apps/../x"), std::string("."), std::string("a/b/c"),
+                                  std::string("apps/."), std::string("a\0b", 3)}) {
+    std::optional<Error> error;
+    EXPECT_FALSE(device.store->load(name, &error));
+    EXPECT_EQ(std::exchange(error, std::nullopt).value_or(Error("", 0)).code(), EINVAL) << name;
+    EXPECT_FALSE(device.store->save(name, "text", &error));
+    EXPECT_EQ(std::exchange(error, std::nullopt).value_or(Error("", 0)).code(), EINVAL) << name;
+    EXPECT_FALSE(device.store->remove(name, &error));
+    EXPECT_EQ(error.value_or(Error("", 0)).code(), EINVAL) << name;
+    EXPECT_FALSE(isSinglePathComponent(name));
+  }
+  for (const char* collection : {"..", "apps/..", ""}) {
+    EXPECT_TRUE(device.store->keys(collection).empty() && !device.store->hasSetAside(collection)) << collection;
+  }
+  EXPECT_EQ(device.store->keys("apps"), std::vector<std::string>{"org.a"});
+  EXPECT_TRUE(device.store->keys("none").empty());
+}
+
+TEST(StateStore, TellsWhatIsMissingFromWhatCannotBeRead) {
+  RegistryDevice device;
+  std::optional<Error> error;
+  EXPECT_FALSE(device.store->load("apps/none", &error) || error);
+  device.files->ownFiles().createDirectory("/state/apps/dir.plist/x", true, {}, nullptr);
+  EXPECT_FALSE(device.store->load("apps/dir", &error));
+  EXPECT_TRUE(std::exchange(error, std::nullopt)) << "a directory in a record's place is no missing record";
+  ASSERT_TRUE(device.store->save("apps/org.a", "kept", nullptr));
+  device.disk.failingCall = 1;
+  EXPECT_FALSE(device.store->remove("apps/org.a", &error));
+  EXPECT_EQ(error->code(), ENOSPC);
+  EXPECT_EQ(device.store->load("apps/org.a", nullptr), PropertyList("kept"));
+}
+
+TEST(StateStore, WhatIsDamagedAgainTakesThePlaceOfWhatWasBefore) {
+  RegistryDevice device;
+  const auto own = device.files->ownFiles();
+  for (const std::string content : {"first", "second"}) {
+    put(device, "/var/mobile/x", content);
+    ASSERT_TRUE(EmbeddedFileManager(own).createDirectory("/state", true, {}, nullptr));
+    ASSERT_TRUE(
+        EmbeddedFileManager(own).writeFile("/state/broken.plist", Bytes(content.begin(), content.end()), nullptr));
+    EXPECT_FALSE(device.store->hasSetAside("."));
+    std::vector<std::string> repairs;
+    ASSERT_TRUE(repairStateRecords(*device.files, repairs, nullptr)) << content;
+    EXPECT_EQ(repairs.size(), 1U);
+    const auto aside = EmbeddedFileManager(own).readFile("/state/broken.plist.damaged", nullptr);
+    EXPECT_EQ(std::string(aside->begin(), aside->end()), content);
+  }
+  device.disk.failingCall = 1;
+  device.disk.forGood = true;
+  std::vector<std::string> repairs;
+  std::optional<Error> error;
+  EXPECT_TRUE(repairStateRecords(*device.files, repairs, &error)) << "nothing to repair, nothing to write";
+  device.disk.failingCall = 0;
+}
+
+// --- settings -------------------------------------------------------------------------------------------------------
+
+TEST(Settings, TakeWhatFitsAndIgnoreWhatARecordShouldNotHold) {
+  RegistryDevice device;
+  EmbeddedSettings settings(*device.store);
+  const std::pair<const char*, std::int64_t> bad[] = {{R"({"AppRemovalAllowed": 3})", kSettingsBadValue},
+                                                      {R"({"AppRemovalAllowed": -1})", kSettingsBadValue},
+                                                      {R"({"AppInstallationAllowed": "1"})", kSettingsBadValue},
+                                                      {R"({"CreateAppPlaceholders": 1})", kSettingsBadValue},
+                                                      {R"({"CreateAppPlaceholders": "no"})", kSettingsBadValue},
+                                                      {R"(["AppRemovalAllowed"])", kSettingsBadValue},
+                                                      {R"({"AppRemovalAllowed": 2, "Other": 1})", kSettingsUnknownKey}};
+  for (const auto& [values, code] : bad) {
+    std::optional<Error> error;
+    EXPECT_FALSE(settings.setValues(plist(values), &error)) << values;
+    ASSERT_TRUE(error) << values;
+    EXPECT_EQ(error->code(), code) << values;
+    EXPECT_FALSE(device.store->load("settings", nullptr)) << values;
+  }
+  EXPECT_FALSE(settings.value("Other", nullptr));
+
+  ASSERT_TRUE(settings.setValues(plist(R"({"AppRemovalAllowed": 0, "AppInstallationAllowed": 2})"), nullptr));
+  EXPECT_EQ(settings.effectiveBoolValueForSetting(TessaFeatureAppInstallationAllowed), TessaBoolean::No);
+  device.store->save("settings", plist(R"({"AppRemovalAllowed": 3, "AppInstallationAllowed": -1,
+                                          "CreateAppPlaceholders": "no", "Other": 1})"),
+                     nullptr);
+  EXPECT_EQ(settings.all().description(),
+            "{AppInstallationAllowed = 0, AppRemovalAllowed = 0, CreateAppPlaceholders = true}");
+  EXPECT_EQ(settings.effectiveBoolValueForSetting(TessaFeatureAppRemovalAllowed), TessaBoolean::NotSet);
+  ASSERT_TRUE(settings.setValue("CreateAppPlaceholders", false, nullptr));
+  std::optional<Error> error;
+  EXPECT_FALSE(settings.makeVaultryManager()->dovelShouldCreateAppPlaceholdersWithError(&error));
+  EXPECT_EQ(error.value_or(Error("", 0)).code(), kSettingsNoPlaceholders);
+}
+
+// --- notifications --------------------------------------------------------------------------------------------------
+
+TEST(Notifications, AWordIsKeptByNameAndAPostReachesItsObserversAlone) {
+  RegistryDevice device;
+  EmbeddedNotificationCenter center(*device.executor);
+  EmbeddedNotificationService service(*device.store, center);
+  int first = -1;
+  int second = -1;
+  int again = -1;
+  EXPECT_NE(service.registerCheck("", first), 0U);
+  EXPECT_EQ(service.registerCheck("org.first", first) + service.registerCheck("org.second", second) +
+                service.registerCheck("org.first", again),
+            0U);
+  EXPECT_EQ(first, again);
+  EXPECT_NE(first, second);
+  service.setState(first, 7);
+  service.setState(second, ~0ULL);
+  for (const int unknown : {-1, 2, 1 << 30}) service.setState(unknown, 9);
+  EXPECT_EQ(notificationsStatus(*device.store).description(), "{org.first = 7, org.second = 18446744073709551615}");
+  EXPECT_EQ(EmbeddedNotificationService(*device.store, center).state("org.second"), ~0ULL) << "kept from run to run";
+  EXPECT_EQ(service.state("org.third"), 0U);
+
+  std::string heard;
+  const auto observe = [&](const char* name) {
+    const auto observer = std::shared_ptr<void>(&heard, [](void*) {});
+    center.addObserver(
+        observer,
+        [](NotificationCenter*, void* text, const std::string& posted, const void*, const void*) {
+          *static_cast<std::string*>(text) += posted + " ";
+        },
+        name, NotificationSuspension::DeliverImmediately);
+    return observer;
+  };
+  const auto posted = [&] {
+    heard.clear();
+    for (const char* name : {"org.first", "org.second", "org.third"}) service.post(name);
+    device.executor->drain();
+    return heard;
+  };
+  const auto one = observe("org.first");
+  const auto other = std::make_shared<int>();
+  center.addObserver(
+      one, [](NotificationCenter*, void* text, auto&, auto*, auto*) { *static_cast<std::string*>(text) += "also "; },
+      "org.second", NotificationSuspension::Drop);
+  EXPECT_EQ(posted(), "org.first also ");
+  center.removeObserver(other, "org.first");  // another observer
+  center.removeObserver(one, "org.third");    // another name
+  EXPECT_EQ(posted(), "org.first also ");
+  center.removeObserver(one, "org.second");
+  EXPECT_EQ(posted(), "org.first ");
+}
+
+// --- the home screen ------------------------------------------------------------------------------------------------
+
+TEST(HomeScreen, WhatIsNoIdentifierHasNoPlace) {
+  RegistryDevice device;
+  std::optional<Error> error;
+  ASSERT_TRUE(device.homeScreen->setLayout(
+      plist(R"([["", "org.b", 5, {"iconLists": "org.x"}, {"iconLists": {"a": "org.y"}}, {"iconLists": [["org.a"]]},
+                 "org.b"], true])"),
+      nullptr));
+  EXPECT_EQ(homeScreenStatus(*device.store).description(), "[org.b, org.a]");
+  for (const char* layout : {R"({"iconLists": []})", R"("org.a")"}) {
+    EXPECT_FALSE(device.homeScreen->setLayout(plist(layout), &error));
+    EXPECT_EQ(error.value_or(Error("", 0)).code(), kDeviceBadSeed);
+  }
+}
+
+TEST(HomeScreen, AnUpdateKeepsItsPlace) {
+  RegistryDevice device;
+  const char* one = R"([{"identifier": "org.z"}])";
+  seed(device, one, "[]");
+  seed(device, R"([{"identifier": "org.a"}])", R"([{"identifier": "org.p"}])");
+  seed(device, one, one);  // again, and its placeholder
+  seed(device, R"([{"identifier": "org.p"}])", "[]");
+  EXPECT_EQ(homeScreenStatus(*device.store).description(), "[org.z, org.p, org.a]");
+}
+
+// --- icons ----------------------------------------------------------------------------------------------------------
+
+TEST(Icons, OneWholePictureMakesAFile) {
+  RegistryDevice device;
+  EmbeddedIconServices icons(*device.files);
+  const Image good{.width = 2, .height = 1, .pixels = Bytes(8, 100)};
+  const std::pair<const char*, std::vector<Image>> cases[] = {
+      {"none", {}},
+      {"two", {good, good}},
+      {"no width", {{.width = 0, .height = 1, .pixels = {}}}},
+      {"no height", {{.width = 1, .height = 0, .pixels = {}}}},
+      {"too few pixels", {{.width = 2, .height = 2, .pixels = Bytes(8)}}},
+      {"too many pixels", {{.width = 1, .height = 1, .pixels = Bytes(8)}}},
+      {"good", {good}}};
+  for (const auto& [title, images] : cases) {
+    Bytes buffer{1, 2, 3};
+    const auto destination = icons.makePNGDestination(buffer);
+    for (const Image& image : images) destination->addImage(image);
+    const bool isGood = title == std::string("good");
+    EXPECT_EQ(destination->finalize(), isGood) << title;
+    const auto read = decodePNG(buffer);
+    EXPECT_EQ(read.has_value(), isGood) << title;
+    if (!isGood) {
+      EXPECT_EQ(buffer, (Bytes{1, 2, 3})) << title;
+    } else {
+      EXPECT_EQ(read->pixels, good.pixels);
+    }
+  }
+}
+
+TEST(Icons, APictureOfAnyColourTypeIsRead) {
+  // One pixel each: with a palette, and with colours but no opacity.
+  for (const std::string hex : {"89504e470d0a1a0a0000000d494844520000000100000001080300000028cb34bb00000003504c54450908"
+                                "07fe1619fe0000000a49444154789c636000000002000148afa4710000000049454e44ae426082",
+                                "89504e470d0a1a0a0000000d4948445200000001000000010802000000907753de0000000c49444154789c"
+                                "63e0e4600700003600196eb52a2a0000000049454e44ae426082"}) {
+    Bytes file;
+    for (std::size_t at = 0; at < hex.size(); at += 2) {
+      file.push_back(static_cast<std::uint8_t>(std::stoi(hex.substr(at, 2), nullptr, 16)));
+    }
+    const auto image = decodePNG(file);
+    ASSERT_TRUE(image);
+    EXPECT_EQ(image->pixels, (Bytes{9, 8, 7, 255}));
+  }
+}
+
+TEST(Icons, ABundleIsADirectoryAndItsInformationADictionary) {
+  RegistryDevice device;
+  EmbeddedIconServices icons(*device.files);
+  const FileURL url = *FileURL::fileURLWithPath("/var/mobile/Media/a", true);
+  put(device, "/var/mobile/Media/a", "a file");
+  EXPECT_FALSE(icons.bundleWithURL(url));
+  device.files->removeItem("/var/mobile/Media/a", nullptr);
+  for (const char* content : {"<plist><array/></plist>", "<plist>", "<plist><string>x</string></plist>"}) {
+    put(device, "/var/mobile/Media/a/Info.plist", content);
+    EXPECT_EQ(icons.bundleWithURL(url)->infoDictionary, PropertyList::dictionary()) << content;
+  }
+  // Beyond the first 64 pictures none is looked at, and no picture may be higher than 4096 pixels either.
+  Bytes small;
+  Bytes high;
+  for (const auto& [buffer, height] : {std::pair(&small, 1U), std::pair(&high, 4097U)}) {
+    const auto destination = icons.makePNGDestination(*buffer);
+    destination->addImage({.width = 1, .height = height, .pixels = Bytes(4ULL * height, 50)});
+    ASSERT_TRUE(destination->finalize());
+  }
+  PropertyList names = PropertyList::array();
+  for (int i = 0; i < 65; ++i) names.append(std::to_string(i));
+  const auto hasIcon = [&] {
+    return icons
+        .GlintCreateDeviceAppropriateHomeScreenIconImageFromBundle(
+            {url, PropertyList::dictionary({{"TefBundleIconFiles", names}})})
+        .has_value();
+  };
+  for (int i = 0; i < 64; ++i) put(device, "/var/mobile/Media/a/" + std::to_string(i), {high.begin(), high.end()});
+  put(device, "/var/mobile/Media/a/64", {small.begin(), small.end()});
+  EXPECT_TRUE(hasIcon()) << "what cannot be read is not counted";
+  put(device, "/var/mobile/Media/a/63", {small.begin(), small.end()});
+  EXPECT_TRUE(hasIcon());
+  device.files->createDirectory("/var/mobile/Media/b/64", true, {}, nullptr);
+  EXPECT_FALSE(icons.GlintCreateDeviceAppropriateHomeScreenIconImageFromBundle(
+      {*FileURL::fileURLWithPath("/var/mobile/Media/b", true), plist(R"({"TefBundleIconFiles": ["64", 5]})")}));
+}
+
+// --- the registry ---------------------------------------------------------------------------------------------------
+
+TEST(Registry, ARestoredPlaceholderThatStandsAloneIsAnApplication) {
+  RegistryDevice device;
+  seed(device, R"([{"identifier": "org.both"}])", R"([{"identifier": "org.both", "installType": 2},
+       {"identifier": "org.0"}, {"identifier": "org.1", "installType": 1}, {"identifier": "org.2", "installType": 2},
+       {"identifier": "org.4", "installType": 4}, {"identifier": "org.7", "installType": 7},
+       {"identifier": "org.8", "installType": 8}])");
+  std::string walked;
+  device.registry->enumerateBundlesOfType(kPellumBundleTypeApplication, [&](const auto& record, bool&) {
+    walked += record.bundleIdentifier + (record.isPlaceholder() ? "* " : " ");
+  });
+  EXPECT_EQ(walked, "org.2* org.7* org.8* org.both ");
+}
+
+TEST(Registry, RefusesIdentifiersThatNameNoFile) {
+  RegistryDevice device;
+  const auto before = device.containers();
+  for (const char* bundleID : {"..", "a/b", ""}) {
+    PlaceholderDescription placeholder;
+    placeholder.bundleID = bundleID;
+    InstalledApplication application;
+    application.bundleID = bundleID;
+    std::optional<Error> error;
+    EXPECT_FALSE(device.registry->installPlaceholder(placeholder, &error));
+    EXPECT_EQ(std::exchange(error, std::nullopt).value_or(Error("", 0)).code(), kRegistryBadIdentifier);
+    EXPECT_FALSE(device.registry->commitInstall(application, &error));
+    EXPECT_EQ(error.value_or(Error("", 0)).code(), kRegistryBadIdentifier);
+  }
+  EXPECT_EQ(device.containers(), before);
+}
+
+TEST(Registry, WhatIsReplacedOrRemovedIsGoneFromTheDiskAtOnce) {
+  RegistryDevice device;
+  const std::string one = R"([{"identifier": "org.a"}])";
+  seed(device, one, one);
+  const auto before = device.containers();
+  seed(device, one, one);
+  EXPECT_EQ(device.containers().size(), 2U);
+  EXPECT_NE(device.containers(), before);
+  // A seeded application comes beside the placeholder, also after a restart; an installed one takes its place.
+  device.restart();
+  EXPECT_TRUE(device.registry->applicationProxyForIdentifier("org.a", true));
+  InstalledApplication update;
+  update.bundleID = "org.a";
+  update.containerPath = std::string(kContainersDirectory) + "/99";
+  put(device, update.containerPath + "/A.app/x", "new");
+  ASSERT_TRUE(device.registry->commitInstall(update, nullptr));
+  EXPECT_EQ(device.containers(), std::vector<std::string>{"99"});
+  seed(device, "[]", one);
+  EXPECT_TRUE(device.registry->removePlaceholder("org.a", nullptr));
+  EXPECT_EQ(device.containers(), std::vector<std::string>{"99"});
+  EXPECT_TRUE(device.registry->removeApplication("org.a", nullptr));
+  EXPECT_TRUE(device.containers().empty());
+}
+
+// A removal whose record stays has not happened, whoever asks, and says so.
+TEST(Registry, WhatCannotBeForgottenStays) {
+  using Operation = std::function<bool(RegistryDevice&, std::optional<Error>*)>;
+  const std::pair<const char*, Operation> operations[] = {
+      {"removePlaceholder",
+       [](auto& device, auto* error) { return device.registry->removePlaceholder("org.a", error); }},
+      {"removeApplication",
+       [](auto& device, auto* error) { return device.registry->removeApplication("org.b", error); }},
+      {"uninstall placeholder",
+       [](auto& device, auto* error) { return device.registry->uninstallApplication("org.a", error); }},
+      {"uninstall application",
+       [](auto& device, auto* error) { return device.registry->uninstallApplication("org.b", error); }},
+      {"installPlaceholder", [](auto& device, auto* error) {
+         PlaceholderDescription placeholder;
+         placeholder.bundleID = "org.a";
+         placeholder.name = "new";
+         return device.registry->installPlaceholder(placeholder, error);
+       }}};
+  for (const auto& [title, operation] : operations) {
+    SCOPED_TRACE(title);
+    RegistryDevice device;
+    seed(device, R"([{"identifier": "org.b"}])", R"([{"identifier": "org.a", "name": "old"}])");
+    const auto before = device.containers();
+    bool isDone = false;
+    for (int call = 1; !isDone; ++call) {
+      ASSERT_LT(call, 200);
+      device.disk.failingCall = call;
+      std::optional<Error> error;
+      isDone = operation(device, &error);
+      ASSERT_EQ(isDone, !error) << call;
+      if (isDone) break;
+      EXPECT_EQ(error->code(), kRegistryDisk) << call;
+      EXPECT_TRUE(error->underlyingError()) << call;
+      EXPECT_EQ(device.containers(), before) << call;
+      EXPECT_EQ(device.registry->applicationProxyForIdentifier("org.a", true)->localizedName, "old") << call;
+      EXPECT_TRUE(device.registry->applicationIsInstalled("org.b")) << call;
+    }
+  }
+}
+
+// What a record names is removed with it, so a record that names anything but a container is not believed.
+TEST(Registry, ARecordNamesAContainerAndNothingElse) {
+  const std::string containers(kContainersDirectory);
+  const std::string placeholders(kPlaceholdersDirectory);
+  const std::pair<std::string, std::string> cases[] = {
+      {containers + "/5", placeholders + "/5"},   {containers, placeholders},
+      {containers + "/", placeholders + "/"},     {containers + "x5", placeholders + "x5"},
+      {containers + "/..", placeholders + "/.."}, {containers + "/5/6", placeholders + "/5/6"},
+      {"/var/mobile/Media", "/var/mobile/Media"}, {"", ""}};
+  for (const auto& [application, placeholder] : cases) {
+    SCOPED_TRACE(application);
+    RegistryDevice device;
+    put(device, "/var/mobile/Media/photo", "years");
+    for (const auto& [name, path] :
+         {std::pair("applications/org.a", application), std::pair("placeholders/org.b", placeholder)}) {
+      device.store->save(name, PropertyList::dictionary({{"container", path}, {"name", "A"}}), nullptr);
+    }
+    device.restart();
+    const bool isGood = application.ends_with("s/5");
+    EXPECT_EQ(device.registry->applicationIsInstalled("org.a"), isGood);
+    EXPECT_EQ(device.registry->applicationProxyForIdentifier("org.b", true).has_value(), isGood);
+    device.registry->removeApplication("org.a", nullptr);
+    device.registry->uninstallApplication("org.b", nullptr);
+    EXPECT_EQ(device.text("/var/mobile/Media/photo"), "years");
+    EXPECT_TRUE(device.files->fileExists(placeholders));
+  }
+}
+
+// With a damaged record a whole container may be that record's, and the next one must not get its name.
+TEST(Registry, AContainerThatMayBeSomebodysKeepsItsName) {
+  RegistryDevice device;
+  put(device, std::string(kContainersDirectory) + "/500/A.app/x", "x");
+  put(device, std::string(kContainersDirectory) + "/.501/A.app/x", "unfinished");
+  put(device, std::string(kContainersDirectory) + "/other/A.app/x", "x");
+  device.store->save("applications/org.a", "damaged", nullptr);
+  device.restart();
+  EXPECT_EQ(device.containers(), (std::vector<std::string>{"500", "other"}));
+  EXPECT_EQ(device.registry->newContainerName(), "501");
+}
+
+TEST(Registry, ACancellationNamesItsApplicationEvenWithoutAPlaceholder) {
+  struct Observer : PellumApplicationWorkspaceObserver {
+    std::string heard;
+    void applicationInstallsArePrioritized(const PellumApplicationProxies&, const PellumApplicationProxies&) override {}
+    void applicationInstallsDidCancel(const PellumApplicationProxies& applications) override {
+      for (const auto& one : applications) heard += one.applicationIdentifier + "=" + one.bundleIdentifier + " ";
+    }
+  };
+  RegistryDevice device;
+  const auto observer = std::make_shared<Observer>();
+  device.registry->addObserver(observer);
+  device.registry->installsDidCancel("org.gone");
+  device.executor->drain();
+  EXPECT_EQ(observer->heard, "org.gone=org.gone ");
+}
+
+TEST(RegistrySeed, EveryFieldIsShownAsItWasSeeded) {
+  RegistryDevice device;
+  seed(device,
+       R"([{"identifier": "org.a", "version": "1.2", "name": "A", "type": "System", "size": 70000, "installState": 2,
+            "installPhase": 1, "prioritized": false, "progress": false},
+           {"identifier": "org.b", "files": {"d/e/x": 1000, "d/e/y": 2000, "d/z": 0}}])",
+       R"([{"identifier": "org.p", "name": "P", "installType": 7, "version": "3", "launchProhibited": true,
+            "type": "System", "installState": 1, "installPhase": 2, "prioritized": true, "progress": false},
+           {"identifier": "org.q"}])");
+  device.restart();
+  const std::string installed = registryInstalledStatus(*device.store).description();
+  EXPECT_EQ(installed.substr(0, installed.find(", {identifier = org.b")),
+            "[{identifier = org.a, version = 1.2, name = A, type = System, size = 70000, container = "
+            "var/mobile/Containers/5, installState = 2, installPhase = 1, prioritized = false, progress = false}");
+  EXPECT_EQ(installed.find("version", installed.find("org.b")), std::string::npos);
+  EXPECT_EQ(
+      registryPlaceholdersStatus(*device.store).description(),
+      "[{identifier = org.p, name = P, installType = 7, version = 3, launchProhibited = true, type = System, "
+      "installState = 1, installPhase = 2, prioritized = true, progress = false}, {identifier = org.q, name = org.q, "
+      "installType = 0, launchProhibited = false, type = User}]");
+  const auto record = device.registry->applicationProxyForIdentifier("org.b", false);
+  const std::string bundle = record->bundleURL->path();
+  EXPECT_EQ(device.files->attributesOfItem(bundle + "/d/e/y", nullptr)->size, 2000U);
+  EXPECT_EQ(record->diskUsage.staticUsage, device.files->treeSize(record->bundleContainerURL->path()));
+  const auto info = parsePropertyList(*device.files->readFile(bundle + "/Info.plist", nullptr), nullptr);
+  EXPECT_EQ(info->description(), "{TefBundleIdentifier = org.b}");
+}
+
+TEST(RegistrySeed, WhatASeedSaysOfAnInstallIsWhatTheRecordShows) {
+  RegistryDevice device;
+  seed(
+      device,
+      R"([{"identifier": "org.a"}, {"identifier": "org.b", "installState": 1}, {"identifier": "org.c", "installPhase": 2},
+           {"identifier": "org.d", "prioritized": true}, {"identifier": "org.e", "installState": 1, "progress": false}])",
+      "[]");
+  std::string shown;
+  device.registry->enumerateBundlesOfType(kPellumBundleTypeAll, [&](const auto& record, bool&) {
+    const auto& progress = record.installProgressSync;
+    shown += progress ? std::to_string(progress->installState) + std::to_string(progress->installPhase) + " " : "- ";
+  });
+  EXPECT_EQ(shown, "- 10 02 - - ");
+}
+
+TEST(RegistrySeed, WhatDoesNotFitIsRefused) {
+  const std::pair<const char*, const char*> bad[] = {{R"({"files": {"x": -1}})", "files"},
+                                                     {R"({"files": {"x": "1"}})", "files"},
+                                                     {R"({"files": {"x": 1099511627777}})", "files"},
+                                                     {R"({"files": {"Info.plist/x": 1}})", "files"},
+                                                     {R"({"files": {"a/b": 1, "a": 1}})", "files"},
+                                                     {R"({"files": []})", "files"},
+                                                     {R"({"version": 1})", "version"},
+                                                     {R"({"installState": -1})", "installState"},
+                                                     {R"({"progress": "no"})", "progress"},
+                                                     {R"({"name": true})", "name"}};
+  for (const auto& [fields, key] : bad) {
+    PropertyList entry = plist(fields);
+    entry.set("identifier", "org.a");
+    std::optional<Error> error;
+    EXPECT_FALSE(checkInstalledSeed(PropertyList::array({entry}), &error)) << fields;
+    ASSERT_TRUE(error) << fields;
+    EXPECT_EQ(error->code(), kDeviceBadSeed);
+    EXPECT_NE(error->text().find(std::string("(org.a): \"") + key), std::string::npos) << error->text();
+  }
+}
+
+}  // namespace
+}  // namespace appsync
