@@ -24,6 +24,11 @@ int exitStatus(int status) {
 const std::string kProgram = std::string(APPSYNC_BIN_DIR) + "/dovel";
 
 Outcome dovel(const Arguments& arguments, const std::function<void(pid_t, const std::string&)>& watch) {
+  return runProgram(kProgram, arguments, watch);
+}
+
+Outcome runProgram(const std::string& program, const Arguments& arguments,
+                   const std::function<void(pid_t, const std::string&)>& watch) {
   std::array<int, 2> out{};
   std::array<int, 2> err{};
   if (::pipe2(out.data(), O_CLOEXEC) != 0 || ::pipe2(err.data(), O_CLOEXEC) != 0) return {};
@@ -31,11 +36,11 @@ Outcome dovel(const Arguments& arguments, const std::function<void(pid_t, const 
   ::posix_spawn_file_actions_init(&actions);
   ::posix_spawn_file_actions_adddup2(&actions, out[1], 1);
   ::posix_spawn_file_actions_adddup2(&actions, err[1], 2);
-  std::vector<char*> list{const_cast<char*>(kProgram.c_str())};
+  std::vector<char*> list{const_cast<char*>(program.c_str())};
   for (const std::string& argument : arguments) list.push_back(const_cast<char*>(argument.c_str()));
   list.push_back(nullptr);
   pid_t process = 0;
-  const int failed = ::posix_spawn(&process, kProgram.c_str(), &actions, nullptr, list.data(), environ);
+  const int failed = ::posix_spawn(&process, program.c_str(), &actions, nullptr, list.data(), environ);
   ::posix_spawn_file_actions_destroy(&actions);
   ::close(out[1]);
   ::close(err[1]);

@@ -29,7 +29,10 @@ struct Outcome {
 
 extern const std::string kProgram;
 
-// Runs the program to its end; `watch` sees its output as it comes and may send it signals.
+// Runs a program to its end; `watch` sees its output as it comes and may send it signals.
+Outcome runProgram(const std::string& program, const Arguments& arguments,
+                   const std::function<void(pid_t, const std::string&)>& watch = {});
+// The same for this project's own.
 Outcome dovel(const Arguments& arguments, const std::function<void(pid_t, const std::string&)>& watch = {});
 // The same on a terminal of this many columns and rows; `out` is all that it shows.
 Outcome dovelOnTerminal(const Arguments& arguments, unsigned short columns, unsigned short rows,
