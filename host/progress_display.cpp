@@ -62,6 +62,7 @@ void ProgressDisplay::end() {
   {
     MutexLock lock(_mutex);
     _hasEnded = true;
+    _isStale = true;  // the picture before may have left rows out
     _changed.notify_all();
   }
   if (_drawer.joinable()) _drawer.join();
