@@ -176,9 +176,10 @@ class Grammar {
 
   void addSample() {
     SampleOptions& sample = _parsed.sample;
-    CLI::App* command = add("sample", "Write a host directory with sample applications",
+    CLI::App* command = add("sample", "Write a host directory, or a backup, with sample applications",
                             [&sample](Console& console) { return runSample(sample, console); });
     command->add_option("DIR", sample.directory, "The directory to write; new, or empty")->required();
+    command->add_flag("--backup", sample.backup, "Write a backup directory, for dovel restore");
     command->add_option("--apps", sample.applications, "How many applications (default 8)")
         ->check(isWholeNumber)
         ->check(CLI::Range(0, 10000))

@@ -73,6 +73,7 @@ struct PlistOptions {
 
 struct SampleOptions {
   std::string directory;
+  bool backup = false;  // a backup directory instead of a host's
   std::uint32_t applications = 8;
   std::uint64_t seed = 1;
 };

@@ -1,4 +1,4 @@
-// `dovel sample`: write a host directory with sample applications, the same bytes for the same seed.
+// `dovel sample`: write a host directory, or a backup, with sample applications, the same bytes for the same seed.
 #include <algorithm>
 #include <array>
 #include <cstdint>
@@ -9,6 +9,7 @@
 #include "embedded/disk.h"
 #include "embedded/file_manager.h"
 #include "embedded/icons.h"
+#include "host/backup_directory.h"
 #include "host/commands.h"
 #include "host/package_writer.h"
 #include "host/sample_icon.h"
@@ -102,6 +103,32 @@ class SampleWriter {
            writeList("ApplicationSync/BrelmIconState.plist", layout(applications), PropertyListFormat::Binary);
   }
 
+  // Of three applications one is as it was, one demoted by the system and one by the person; the second of all is
+  // without an icon.
+  bool writeBackup(const std::vector<SampleApplication>& applications) {
+    PropertyList list = PropertyList::dictionary();
+    PropertyList automatic = PropertyList::array();
+    PropertyList intentional = PropertyList::array();
+    for (std::size_t i = 0; i < applications.size(); ++i) {
+      const SampleApplication& application = applications[i];
+      const auto bytes = serializePropertyList(backupMetadata(application), PropertyListFormat::Binary, nullptr);
+      if (!bytes) return false;
+      PropertyList entry = PropertyList::dictionary({{"TarvoMetadata", PropertyList::data(*bytes)}});
+      if (i != 1) {
+        const std::string icon = png(sampleIcon(application.look, 120));
+        entry.set("PlaceholderIcon", PropertyList::data(Bytes(icon.begin(), icon.end())));
+      }
+      list.set(application.identifier, entry);
+      if (i % 3 == 1) automatic.append(application.identifier);
+      if (i % 3 == 2) intentional.append(application.identifier);
+    }
+    return writeList(kBackupRestoreList, list, PropertyListFormat::XML) &&
+           writeList(
+               kBackupDemotedApps,
+               PropertyList::dictionary({{"AutomaticDowngrades", automatic}, {"IntentionalDowngrades", intentional}}),
+               PropertyListFormat::Binary);
+  }
+
   const std::string& failedPath() const { return _failedPath; }
 
  private:
@@ -130,6 +157,20 @@ class SampleWriter {
                                      {"bundleVersion", application.version},
                                      {"itemId", PropertyList::integer(application.itemID)},
                                      {"purchaseDate", PropertyList::date(790'000'000)}});
+  }
+
+  // The applications belong to two accounts in turn.
+  static PropertyList backupMetadata(const SampleApplication& application) {
+    const bool isFirst = application.itemID % 2 == 0;
+    const char* account = isFirst ? "first@example.org" : "second@example.org";
+    PropertyList made = metadata(application);
+    made.set("is-auto-download", true);
+    made.set(
+        "com.zelk.TarvoStore.downloadInfo",
+        PropertyList::dictionary(
+            {{"accountInfo", PropertyList::dictionary(
+                                 {{"ZelkID", account}, {"QenPersonID", PropertyList::integer(isFirst ? 1 : 2)}})}}));
+    return made;
   }
 
   static std::optional<std::string> packageOf(const SampleApplication& application, const PropertyList& info,
@@ -229,10 +270,15 @@ int runSample(const SampleOptions& options, Console& console) {
     return console.fail({FailureCode::OutputUnwritable, "\"" + options.directory + "\" is there already and not empty",
                          "name a new directory"});
   }
-  fs::create_directories(root / "ApplicationSync", error);
-  fs::create_directories(root / "Packages", error);
+  if (options.backup) {
+    fs::create_directories(root, error);
+  } else {
+    fs::create_directories(root / "ApplicationSync", error);
+    fs::create_directories(root / "Packages", error);
+  }
   SampleWriter writer(root);
-  if (error || !writer.write(makeApplications(options.applications, options.seed))) {
+  const std::vector<SampleApplication> applications = makeApplications(options.applications, options.seed);
+  if (error || !(options.backup ? writer.writeBackup(applications) : writer.write(applications))) {
     const std::string where = writer.failedPath().empty() ? options.directory : writer.failedPath();
     return console.fail({FailureCode::OutputUnwritable, "\"" + where + "\" cannot be written",
                          "name a directory in a place with room that can be written"});

@@ -64,6 +64,8 @@ class DovelClient {
   // for a todo list that could not be read.
   virtual bool reconcileSync(std::uint32_t type, const std::string& newAnchor, const ProgressCallback& progressCallback,
                              ErrorOut error) = 0;
+  // After a restore from a backup: brings its applications back as placeholders and waits for these, for a bounded time.
+  // True; `error` is always overwritten, with the reason why placeholders were not to be made, or none.
   virtual bool reconcileRestoreOfType(std::int32_t /*type*/, ErrorOut /*error*/) { return true; }
   virtual void syncEndedWithSuccess(bool success) = 0;
 
@@ -79,8 +81,10 @@ class DovelClient {
   // Forgets everything about syncs.
   virtual void clearSyncData() = 0;
 
+  // The ids of the store accounts that the device's applications belong to, and a record for each account.
   virtual std::set<std::string> zelkIDsForAssets() { return {}; }
   virtual std::vector<DovelMutableAccountInfo> accountsForAssets() { return {}; }
+  // Tidies the applications' store metadata. What cannot be read or written is left as it is.
   virtual void prepareForBackup() {}
   // The asset types that must not be synced; none when nothing is disabled.
   virtual std::optional<std::set<std::string>> disabledAssetTypes() { return std::nullopt; }
