@@ -87,6 +87,7 @@ class RestoreRun {
   // What came of it. Asked before the session is closed.
   RestoreReport report() {
     _session.drainExecutor();  // a placeholder that came too late for the wait counts too
+    _progress.end();
     if (const auto problem = _progress.listProblem()) {
       _report.error = "\"" + _backup.path() + "/" + kBackupRestoreList + "\" cannot be used: " + *problem;
     }

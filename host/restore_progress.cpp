@@ -78,7 +78,7 @@ std::string_view wordFor(RestoreProgress::State state) {
 
 }  // namespace
 
-RestoreProgress::~RestoreProgress() {
+void RestoreProgress::end() {
   {
     const MutexLock lock(_mutex);
     _isWaiting = false;

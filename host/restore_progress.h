@@ -39,13 +39,16 @@ class RestoreProgress : public LogSink {
 
   // `drawsInPlace`: the line of the wait is drawn anew each second. The console must outlive this.
   RestoreProgress(Console& console, bool drawsInPlace) : _console(console), _drawsInPlace(drawsInPlace) {}
-  ~RestoreProgress() override;
+  ~RestoreProgress() override { end(); }
   RestoreProgress(const RestoreProgress&) = delete;
   RestoreProgress& operator=(const RestoreProgress&) = delete;
 
   void line(const LogLine& line) override;
   void transaction(const TransactionRecord& record) override;
   void hear(const CoordinatorEvent& event);
+
+  // The line of the wait is gone when this returns, and what is written to the console from then on comes below.
+  void end();
 
   // What has come of it so far, in the order of the list.
   std::vector<Application> applications() const;
