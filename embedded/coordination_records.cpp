@@ -3,6 +3,7 @@
 
 #include "embedded/coordination.h"
 #include "embedded/coordination_objects.h"
+#include "embedded/record_fields.h"
 #include "embedded/registry.h"
 #include "embedded/state_store.h"
 
@@ -30,32 +31,9 @@ std::optional<OstrelCoordinatorKind> kindNamed(std::string_view name) {
   return std::nullopt;
 }
 
-std::optional<std::string> text(const PropertyList& dictionary, std::string_view key) {
-  const PropertyList* value = dictionary.find(key);
-  return value != nullptr ? value->string() : std::nullopt;
-}
-
-bool flag(const PropertyList& dictionary, std::string_view key) {
-  const PropertyList* value = dictionary.find(key);
-  return value != nullptr && value->boolean().value_or(false);
-}
-
-std::optional<std::uint64_t> number(const PropertyList& dictionary, std::string_view key) {
-  const PropertyList* value = dictionary.find(key);
-  return value != nullptr ? value->unsignedInteger() : std::nullopt;
-}
-
 std::optional<PropertyList> part(const PropertyList& dictionary, std::string_view key) {
   const PropertyList* value = dictionary.find(key);
   return value != nullptr && value->isDictionary() ? std::optional(*value) : std::nullopt;
-}
-
-void setIfThere(PropertyList& dictionary, std::string_view key, const std::optional<std::string>& value) {
-  if (value) dictionary.set(key, *value);
-}
-
-void setIfThere(PropertyList& dictionary, std::string_view key, const std::optional<PropertyList>& value) {
-  if (value) dictionary.set(key, *value);
 }
 
 // --- the parts of a record ------------------------------------------------------------------------------------------
@@ -76,9 +54,9 @@ std::optional<Error> errorFrom(const PropertyList* chain) {
   for (std::size_t i = chain->count(); i-- > 0;) {
     const PropertyList& link = chain->elements()[i];
     const PropertyList* code = link.find("Code");
-    const std::string domain = text(link, "Domain").value_or(std::string(kOstrelErrorDomain));
+    const std::string domain = textIn(link, "Domain").value_or(std::string(kOstrelErrorDomain));
     const std::int64_t value = code != nullptr ? code->integer().value_or(0) : 0;
-    const std::string words = text(link, "Text").value_or("");
+    const std::string words = textIn(link, "Text").value_or("");
     error = error ? Error(domain, value, words, *error) : Error(domain, value, words);
   }
   return error;
@@ -94,15 +72,15 @@ PropertyList recordOf(const KilnInstallOptions& options) {
 
 KilnInstallOptions installOptionsFrom(const PropertyList& record) {
   KilnInstallOptions options;
-  options.setPellumInstallType(number(record, "PellumInstallType").value_or(0));
-  options.setInstallTargetType(number(record, "InstallTargetType").value_or(0));
+  options.setPellumInstallType(numberIn(record, "PellumInstallType").value_or(0));
+  options.setInstallTargetType(numberIn(record, "InstallTargetType").value_or(0));
   options.setTarvoMetadata(KilnStoreMetadata::initWithDictionary(part(record, "TarvoMetadata")));
   return options;
 }
 
 PropertyList recordOf(const CoordinationPromise& promise) {
   PropertyList record = PropertyList::dictionary({{"Name", promise.name}, {"Complete", promise.isComplete}});
-  setIfThere(record, "Path", promise.path);
+  setIfPresent(record, "Path", promise.path);
   return record;
 }
 
@@ -110,9 +88,9 @@ std::shared_ptr<CoordinationPromise> promiseFrom(const std::optional<PropertyLis
                                                  const std::shared_ptr<InstallCoordinator>& owner) {
   if (!record) return nullptr;
   auto promise = std::make_shared<CoordinationPromise>();
-  promise->name = text(*record, "Name").value_or(owner->bundleID);
-  promise->path = text(*record, "Path");
-  promise->isComplete = flag(*record, "Complete");
+  promise->name = textIn(*record, "Name").value_or(owner->bundleID);
+  promise->path = textIn(*record, "Path");
+  promise->isComplete = isTrueIn(*record, "Complete");
   promise->isGiven = true;
   promise->owner = owner;
   return promise;
@@ -123,9 +101,9 @@ PropertyList recordOf(const PlaceholderDescription& placeholder) {
       PropertyList::dictionary({{"Name", placeholder.name},
                                 {"InstallType", PropertyList::unsignedInteger(placeholder.installType)},
                                 {"LaunchProhibited", placeholder.launchProhibited}});
-  setIfThere(record, "BundleVersion", placeholder.bundleVersion);
-  setIfThere(record, "InfoPlist", placeholder.infoPlist);
-  setIfThere(record, "Metadata", placeholder.metadata);
+  setIfPresent(record, "BundleVersion", placeholder.bundleVersion);
+  setIfPresent(record, "InfoPlist", placeholder.infoPlist);
+  setIfPresent(record, "Metadata", placeholder.metadata);
   if (placeholder.icon) record.set("Icon", PropertyList::data(*placeholder.icon));
   return record;
 }
@@ -135,10 +113,10 @@ std::optional<PlaceholderDescription> placeholderFrom(const std::optional<Proper
   if (!record) return std::nullopt;
   PlaceholderDescription placeholder;
   placeholder.bundleID = bundleID;
-  placeholder.name = text(*record, "Name").value_or(bundleID);
-  placeholder.installType = number(*record, "InstallType").value_or(kPellumInstallTypeSync);
-  placeholder.launchProhibited = flag(*record, "LaunchProhibited");
-  placeholder.bundleVersion = text(*record, "BundleVersion");
+  placeholder.name = textIn(*record, "Name").value_or(bundleID);
+  placeholder.installType = numberIn(*record, "InstallType").value_or(kPellumInstallTypeSync);
+  placeholder.launchProhibited = isTrueIn(*record, "LaunchProhibited");
+  placeholder.bundleVersion = textIn(*record, "BundleVersion");
   placeholder.infoPlist = part(*record, "InfoPlist");
   placeholder.metadata = part(*record, "Metadata");
   const PropertyList* icon = record->find("Icon");
@@ -179,24 +157,24 @@ PropertyList coordinatorRecord(const InstallCoordinator& coordinator) {
 }
 
 std::shared_ptr<InstallCoordinator> coordinatorFromRecord(const std::string& bundleID, const PropertyList& record) {
-  const auto kind = kindNamed(text(record, "Kind").value_or(""));
-  const auto creator = number(record, "Creator");
+  const auto kind = kindNamed(textIn(record, "Kind").value_or(""));
+  const auto creator = numberIn(record, "Creator");
   if (!kind || !creator) return nullptr;
   auto coordinator = std::make_shared<InstallCoordinator>();
   coordinator->kind = *kind;
   coordinator->bundleID = bundleID;
   coordinator->creator = *creator;
-  coordinator->responsibleClient = number(record, "ResponsibleClient").value_or(0);
+  coordinator->responsibleClient = numberIn(record, "ResponsibleClient").value_or(0);
   coordinator->error = errorFrom(record.find("Error"));
   if (const auto options = part(record, "InstallOptions")) coordinator->installOptions = installOptionsFrom(*options);
-  coordinator->hasInitialAssetPromises = flag(record, "InitialAssetPromises");
+  coordinator->hasInitialAssetPromises = isTrueIn(record, "InitialAssetPromises");
   coordinator->package = promiseFrom(part(record, "AssetPromise"), coordinator);
   coordinator->userData = promiseFrom(part(record, "UserDataPromise"), coordinator);
   coordinator->placeholder = placeholderFrom(part(record, "Placeholder"), bundleID);
-  coordinator->isPlaceholderInstalled = coordinator->placeholder && flag(record, "PlaceholderInstalled");
+  coordinator->isPlaceholderInstalled = coordinator->placeholder && isTrueIn(record, "PlaceholderInstalled");
   coordinator->life = coordinator->error ? Life::Dead : Life::Live;
   coordinator->isTidy = !coordinator->isLive();
-  coordinator->isSeeded = flag(record, "Seeded");
+  coordinator->isSeeded = isTrueIn(record, "Seeded");
   // A seed may say of the placeholder how its install is shown; that stands until something happens.
   coordinator->shown = coordinator->isSeeded ? Shown::Waiting : Shown::Nothing;
   return coordinator;
@@ -345,27 +323,27 @@ std::uint64_t installTypeOf(OstrelCoordinatorKind kind) {
 PropertyList recordFromSeed(const PropertyList& entry, bool isPlaceholderInstalled) {
   InstallCoordinator coordinator;
   coordinator.isSeeded = true;
-  coordinator.bundleID = *text(entry, "identifier");
-  coordinator.kind = *kindNamed(*text(entry, "kind"));
-  coordinator.creator = number(entry, "creator").value_or(OstrelClientDovel);
-  coordinator.responsibleClient = number(entry, "responsibleClient").value_or(0);
-  if (const auto words = text(entry, "error")) coordinator.error = ostrelError(kOstrelSeeded, *words);
-  if (flag(entry, "installOptions")) {
+  coordinator.bundleID = *textIn(entry, "identifier");
+  coordinator.kind = *kindNamed(*textIn(entry, "kind"));
+  coordinator.creator = numberIn(entry, "creator").value_or(OstrelClientDovel);
+  coordinator.responsibleClient = numberIn(entry, "responsibleClient").value_or(0);
+  if (const auto words = textIn(entry, "error")) coordinator.error = ostrelError(kOstrelSeeded, *words);
+  if (isTrueIn(entry, "installOptions")) {
     coordinator.installOptions.emplace().setPellumInstallType(kPellumInstallTypeSync);
     coordinator.installOptions->setInstallTargetType(1);
   }
-  coordinator.hasInitialAssetPromises = flag(entry, "initialAssetPromises");
-  if (const auto state = text(entry, "assetPromise")) {
+  coordinator.hasInitialAssetPromises = isTrueIn(entry, "initialAssetPromises");
+  if (const auto state = textIn(entry, "assetPromise")) {
     coordinator.package = std::make_shared<CoordinationPromise>();
     coordinator.package->name = coordinator.bundleID + "-Asset";
     coordinator.package->isComplete = *state == "complete";
   }
-  if (flag(entry, "userDataPromise")) {
+  if (isTrueIn(entry, "userDataPromise")) {
     coordinator.userData = std::make_shared<CoordinationPromise>();
     coordinator.userData->name = coordinator.bundleID + "-UserData";
     coordinator.userData->isComplete = true;
   }
-  if (flag(entry, "placeholderPromise")) {
+  if (isTrueIn(entry, "placeholderPromise")) {
     coordinator.placeholder.emplace();
     coordinator.placeholder->name = coordinator.bundleID;
     coordinator.placeholder->installType = installTypeOf(coordinator.kind);
@@ -381,7 +359,7 @@ bool checkCoordinationSeed(const PropertyList& coordinators, ErrorOut error) {
   std::size_t index = 0;
   for (const PropertyList& entry : coordinators.elements()) {
     const std::string where = "coordinators[" + std::to_string(index++) + "]";
-    const auto identifier = text(entry, "identifier");
+    const auto identifier = textIn(entry, "identifier");
     if (!checkEntry(entry, identifier ? where + " (" + *identifier + ")" : where, error)) return false;
   }
   return true;
@@ -390,7 +368,7 @@ bool checkCoordinationSeed(const PropertyList& coordinators, ErrorOut error) {
 bool EmbeddedCoordination::seed(const PropertyList& coordinators, ErrorOut error) {
   if (!checkCoordinationSeed(coordinators, error)) return false;
   for (const PropertyList& entry : coordinators.elements()) {
-    const std::string bundleID = *text(entry, "identifier");
+    const std::string bundleID = *textIn(entry, "identifier");
     const PropertyList record =
         recordFromSeed(entry, _registry.applicationProxyForIdentifier(bundleID, true).has_value());
     if (!_store.save(coordinatorRecordName(bundleID), record, error)) return false;

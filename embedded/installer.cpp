@@ -7,6 +7,7 @@
 #include "embedded/device.h"
 #include "embedded/file_manager.h"
 #include "embedded/fresh_container.h"
+#include "embedded/record_fields.h"
 #include "embedded/registry.h"
 
 namespace appsync {
@@ -24,11 +25,6 @@ struct BundleInformation {
   std::string name;
   std::optional<std::string> version;
 };
-
-std::optional<std::string> stringIn(const PropertyList& dictionary, std::string_view key) {
-  const PropertyList* value = dictionary.find(key);
-  return value == nullptr ? std::nullopt : value->string();
-}
 
 std::optional<BundleInformation> readInformation(EmbeddedFileManager& files, const FreshContainer& container,
                                                  const std::string& bundleID, const std::string& subject,
@@ -48,7 +44,7 @@ std::optional<BundleInformation> readInformation(EmbeddedFileManager& files, con
                           : installerError(kInstallerNotAPackage, text));
     return std::nullopt;
   }
-  const std::optional<std::string> identifier = stringIn(*info, "TefBundleIdentifier");
+  const std::optional<std::string> identifier = textIn(*info, "TefBundleIdentifier");
   if (identifier != bundleID) {
     setError(error, installerError(
                         kInstallerWrongApplication,
@@ -57,7 +53,7 @@ std::optional<BundleInformation> readInformation(EmbeddedFileManager& files, con
                             ", not \"" + bundleID + "\", which was asked for"));
     return std::nullopt;
   }
-  return BundleInformation{stringIn(*info, "TefBundleDisplayName").value_or(""), stringIn(*info, "TefBundleVersion")};
+  return BundleInformation{textIn(*info, "TefBundleDisplayName").value_or(""), textIn(*info, "TefBundleVersion")};
 }
 
 // An update keeps what the registry says of the application's type.

@@ -4,56 +4,14 @@
 #include <string_view>
 #include <utility>
 
+#include "embedded/record_fields.h"
+
 namespace appsync {
 
 namespace {
 
 constexpr char kApplications[] = "applications";
 constexpr char kPlaceholders[] = "placeholders";
-
-// --- reading and writing the fields of a record; an absent one has no key -------------------------------------------
-
-std::string text(const PropertyList& record, std::string_view key) {
-  const PropertyList* value = record.find(key);
-  return value == nullptr ? std::string() : value->string().value_or("");
-}
-
-std::optional<std::string> optionalText(const PropertyList& record, std::string_view key) {
-  const PropertyList* value = record.find(key);
-  return value == nullptr ? std::nullopt : value->string();
-}
-
-std::optional<std::uint64_t> number(const PropertyList& record, std::string_view key) {
-  const PropertyList* value = record.find(key);
-  return value == nullptr ? std::nullopt : value->unsignedInteger();
-}
-
-std::optional<bool> flag(const PropertyList& record, std::string_view key) {
-  const PropertyList* value = record.find(key);
-  return value == nullptr ? std::nullopt : value->boolean();
-}
-
-void setIfPresent(PropertyList& record, std::string_view key, const std::optional<std::string>& value) {
-  if (value) record.set(key, *value);
-}
-
-std::optional<SeededInstall> seededInstall(const PropertyList& record) {
-  SeededInstall seeded;
-  seeded.installState = number(record, "installState");
-  seeded.installPhase = number(record, "installPhase");
-  seeded.prioritized = flag(record, "prioritized");
-  seeded.progress = flag(record, "progress").value_or(true);
-  const bool isSeeded = seeded.installState || seeded.installPhase || seeded.prioritized || !seeded.progress;
-  return isSeeded ? std::optional(seeded) : std::nullopt;
-}
-
-void setSeededInstall(PropertyList& record, const std::optional<SeededInstall>& seeded) {
-  if (!seeded) return;
-  if (seeded->installState) record.set("installState", PropertyList::unsignedInteger(*seeded->installState));
-  if (seeded->installPhase) record.set("installPhase", PropertyList::unsignedInteger(*seeded->installPhase));
-  if (seeded->prioritized) record.set("prioritized", *seeded->prioritized);
-  if (!seeded->progress) record.set("progress", false);
-}
 
 // Whether this is the path of a container in that directory, and of nothing else: what a record names is removed with
 // it.
@@ -100,6 +58,24 @@ std::map<std::string, Record> loadRecords(const StateStore& store, const std::st
 
 }  // namespace
 
+std::optional<SeededInstall> seededInstallIn(const PropertyList& record) {
+  SeededInstall seeded;
+  seeded.installState = numberIn(record, "installState");
+  seeded.installPhase = numberIn(record, "installPhase");
+  seeded.prioritized = flagIn(record, "prioritized");
+  seeded.progress = flagIn(record, "progress").value_or(true);
+  const bool isSeeded = seeded.installState || seeded.installPhase || seeded.prioritized || !seeded.progress;
+  return isSeeded ? std::optional(seeded) : std::nullopt;
+}
+
+void setSeededInstall(PropertyList& record, const std::optional<SeededInstall>& seeded) {
+  if (!seeded) return;
+  if (seeded->installState) record.set("installState", PropertyList::unsignedInteger(*seeded->installState));
+  if (seeded->installPhase) record.set("installPhase", PropertyList::unsignedInteger(*seeded->installPhase));
+  if (seeded->prioritized) record.set("prioritized", *seeded->prioritized);
+  if (!seeded->progress) record.set("progress", false);
+}
+
 PropertyList ApplicationRecord::propertyList() const {
   PropertyList record = PropertyList::dictionary();
   setIfPresent(record, "version", application.bundleVersion);
@@ -117,15 +93,15 @@ PropertyList ApplicationRecord::propertyList() const {
 std::optional<ApplicationRecord> applicationRecord(const std::string& bundleID, const PropertyList& stored) {
   ApplicationRecord record;
   record.application.bundleID = bundleID;
-  record.application.name = text(stored, "name");
-  record.application.bundleVersion = optionalText(stored, "version");
-  record.application.applicationType = text(stored, "type");
-  record.application.containerPath = text(stored, "container");
-  record.application.bundlePath = text(stored, "bundle");
-  record.application.size = number(stored, "size").value_or(0);
-  record.application.seeded = seededInstall(stored);
-  record.arrival = number(stored, "arrival").value_or(0);
-  record.replacedPlaceholder = text(stored, "replacedPlaceholder");
+  record.application.name = textIn(stored, "name").value_or("");
+  record.application.bundleVersion = textIn(stored, "version");
+  record.application.applicationType = textIn(stored, "type").value_or("");
+  record.application.containerPath = textIn(stored, "container").value_or("");
+  record.application.bundlePath = textIn(stored, "bundle").value_or("");
+  record.application.size = numberIn(stored, "size").value_or(0);
+  record.application.seeded = seededInstallIn(stored);
+  record.arrival = numberIn(stored, "arrival").value_or(0);
+  record.replacedPlaceholder = textIn(stored, "replacedPlaceholder").value_or("");
   if (!isContainerIn(kContainersDirectory, record.application.containerPath)) return std::nullopt;
   return record;
 }
@@ -158,14 +134,14 @@ PropertyList PlaceholderRecord::propertyList() const {
 std::optional<PlaceholderRecord> placeholderRecord(const std::string& bundleID, const PropertyList& stored) {
   PlaceholderRecord record;
   record.bundleID = bundleID;
-  record.name = text(stored, "name");
-  record.installType = number(stored, "installType").value_or(0);
-  record.applicationType = text(stored, "type");
-  record.bundleVersion = optionalText(stored, "version");
-  record.launchProhibited = flag(stored, "launchProhibited").value_or(false);
-  record.containerPath = text(stored, "container");
-  record.arrival = number(stored, "arrival").value_or(0);
-  record.seeded = seededInstall(stored);
+  record.name = textIn(stored, "name").value_or("");
+  record.installType = numberIn(stored, "installType").value_or(0);
+  record.applicationType = textIn(stored, "type").value_or("");
+  record.bundleVersion = textIn(stored, "version");
+  record.launchProhibited = isTrueIn(stored, "launchProhibited");
+  record.containerPath = textIn(stored, "container").value_or("");
+  record.arrival = numberIn(stored, "arrival").value_or(0);
+  record.seeded = seededInstallIn(stored);
   if (!isContainerIn(kPlaceholdersDirectory, record.containerPath)) return std::nullopt;
   return record;
 }

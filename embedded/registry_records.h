@@ -26,6 +26,11 @@ struct SeededInstall {
   PellumInstallProgress shown() const { return {installState.value_or(0), installPhase.value_or(0)}; }
 };
 
+// Its fields "installState", "installPhase", "prioritized" and "progress" in a record, in a device's status and in a
+// seed; none when they say nothing.
+std::optional<SeededInstall> seededInstallIn(const PropertyList& record);
+void setSeededInstall(PropertyList& record, const std::optional<SeededInstall>& seeded);
+
 // An installed application, as the installer hands it over.
 struct InstalledApplication {
   std::string bundleID;

@@ -7,6 +7,7 @@
 #include "embedded/device.h"
 #include "embedded/file_manager.h"
 #include "embedded/fresh_container.h"
+#include "embedded/record_fields.h"
 #include "embedded/registry.h"
 
 namespace appsync {
@@ -14,16 +15,6 @@ namespace appsync {
 namespace {
 
 constexpr std::uint64_t kLargestFile = 1ULL << 40;
-
-// --- status ---------------------------------------------------------------------------------------------------------
-
-void copyInstall(const std::optional<SeededInstall>& seeded, PropertyList& entry) {
-  if (!seeded) return;
-  if (seeded->installState) entry.set("installState", PropertyList::unsignedInteger(*seeded->installState));
-  if (seeded->installPhase) entry.set("installPhase", PropertyList::unsignedInteger(*seeded->installPhase));
-  if (seeded->prioritized) entry.set("prioritized", *seeded->prioritized);
-  if (!seeded->progress) entry.set("progress", false);
-}
 
 // --- checks ---------------------------------------------------------------------------------------------------------
 
@@ -129,29 +120,6 @@ bool checkEntries(const std::string& list, const PropertyList& entries, const st
 
 // --- entries --------------------------------------------------------------------------------------------------------
 
-std::optional<std::string> text(const PropertyList& entry, std::string_view key) {
-  const PropertyList* value = entry.find(key);
-  return value == nullptr ? std::nullopt : value->string();
-}
-
-std::optional<std::uint64_t> number(const PropertyList& entry, std::string_view key) {
-  const PropertyList* value = entry.find(key);
-  return value == nullptr ? std::nullopt : value->unsignedInteger();
-}
-
-std::optional<bool> flag(const PropertyList& entry, std::string_view key) {
-  const PropertyList* value = entry.find(key);
-  return value == nullptr ? std::nullopt : value->boolean();
-}
-
-std::optional<SeededInstall> installOf(const PropertyList& entry) {
-  bool named = false;
-  for (const Field& field : kInstallFields) named |= entry.find(field.key) != nullptr;
-  if (!named) return std::nullopt;
-  return SeededInstall{number(entry, "installState"), number(entry, "installPhase"), flag(entry, "prioritized"),
-                       flag(entry, "progress").value_or(true)};
-}
-
 bool addParents(FreshContainer& container, std::set<std::string>& made, std::string_view path, ErrorOut error) {
   for (std::size_t slash = path.find('/'); slash != std::string_view::npos; slash = path.find('/', slash + 1)) {
     const std::string parent(path.substr(0, slash));
@@ -164,7 +132,7 @@ bool addFiles(FreshContainer& container, const PropertyList& entry, ErrorOut err
   const PropertyList* files = entry.find("files");
   if (files == nullptr) {
     // One file makes up for what the property lists do not weigh.
-    const std::uint64_t wanted = number(entry, "size").value_or(0);
+    const std::uint64_t wanted = numberIn(entry, "size").value_or(0);
     const std::uint64_t there = container.size();
     return wanted <= there || container.emptyFile("content", wanted - there, error);
   }
@@ -181,7 +149,7 @@ bool addFiles(FreshContainer& container, const PropertyList& entry, ErrorOut err
 bool fillContainer(FreshContainer& container, const InstalledApplication& application, const PropertyList& entry,
                    ErrorOut error) {
   PropertyList info = PropertyList::dictionary({{"TefBundleIdentifier", application.bundleID}});
-  if (application.bundleVersion) info.set("TefBundleVersion", *application.bundleVersion);
+  setIfPresent(info, "TefBundleVersion", application.bundleVersion);
   if (!application.name.empty()) info.set("TefBundleDisplayName", application.name);
   const PropertyList* metadata = entry.find("storeMetadata");
   return container.bundle(application.bundleID + ".app", error) && container.propertyList("Info.plist", info, error) &&
@@ -196,12 +164,12 @@ PropertyList registryInstalledStatus(const StateStore& store) {
   for (const auto& [bundleID, record] : loadApplicationRecords(store, nullptr)) {
     const InstalledApplication& application = record.application;
     PropertyList entry = PropertyList::dictionary({{"identifier", bundleID}});
-    if (application.bundleVersion) entry.set("version", *application.bundleVersion);
+    setIfPresent(entry, "version", application.bundleVersion);
     entry.set("name", application.name.empty() ? bundleID : application.name);
     entry.set("type", application.applicationType);
     entry.set("size", PropertyList::unsignedInteger(application.size));
     entry.set("container", application.containerPath.substr(1));
-    copyInstall(application.seeded, entry);
+    setSeededInstall(entry, application.seeded);
     entries.append(std::move(entry));
   }
   return entries;
@@ -212,10 +180,10 @@ PropertyList registryPlaceholdersStatus(const StateStore& store) {
   for (const auto& [bundleID, record] : loadPlaceholderRecords(store, nullptr)) {
     PropertyList entry = PropertyList::dictionary({{"identifier", bundleID}, {"name", record.name}});
     entry.set("installType", PropertyList::unsignedInteger(record.installType));
-    if (record.bundleVersion) entry.set("version", *record.bundleVersion);
+    setIfPresent(entry, "version", record.bundleVersion);
     entry.set("launchProhibited", record.launchProhibited);
     entry.set("type", record.applicationType);
-    copyInstall(record.seeded, entry);
+    setSeededInstall(entry, record.seeded);
     entries.append(std::move(entry));
   }
   return entries;
@@ -233,11 +201,11 @@ bool seedInstalled(EmbeddedRegistry& registry, EmbeddedFileManager& files, const
                    ErrorOut error) {
   for (const PropertyList& entry : entries.elements()) {
     InstalledApplication application;
-    application.bundleID = text(entry, "identifier").value_or("");
-    application.name = text(entry, "name").value_or("");
-    application.bundleVersion = text(entry, "version");
-    application.applicationType = text(entry, "type").value_or("User");
-    application.seeded = installOf(entry);
+    application.bundleID = textIn(entry, "identifier").value_or("");
+    application.name = textIn(entry, "name").value_or("");
+    application.bundleVersion = textIn(entry, "version");
+    application.applicationType = textIn(entry, "type").value_or("User");
+    application.seeded = seededInstallIn(entry);
     FreshContainer container(files, kContainersDirectory, registry.newContainerName(),
                              "The application \"" + application.bundleID + "\"");
     if (!fillContainer(container, application, entry, error)) return false;
@@ -254,13 +222,13 @@ bool seedInstalled(EmbeddedRegistry& registry, EmbeddedFileManager& files, const
 bool seedPlaceholders(EmbeddedRegistry& registry, const PropertyList& entries, ErrorOut error) {
   for (const PropertyList& entry : entries.elements()) {
     PlaceholderDescription description;
-    description.bundleID = text(entry, "identifier").value_or("");
-    description.name = text(entry, "name").value_or(description.bundleID);
-    description.installType = number(entry, "installType").value_or(0);
-    description.applicationType = text(entry, "type").value_or("User");
-    description.bundleVersion = text(entry, "version");
-    description.launchProhibited = flag(entry, "launchProhibited").value_or(false);
-    description.seeded = installOf(entry);
+    description.bundleID = textIn(entry, "identifier").value_or("");
+    description.name = textIn(entry, "name").value_or(description.bundleID);
+    description.installType = numberIn(entry, "installType").value_or(0);
+    description.applicationType = textIn(entry, "type").value_or("User");
+    description.bundleVersion = textIn(entry, "version");
+    description.launchProhibited = isTrueIn(entry, "launchProhibited");
+    description.seeded = seededInstallIn(entry);
     if (!registry.installPlaceholder(description, error)) return false;
   }
   return true;
