@@ -25,9 +25,15 @@ constexpr const char* kDirectories[] = {
     "/var/mobile/tmp",
 };
 
-// What can stand in a directory that is to become a device: a first start was cut short, or it is a disk's own.
-bool isHarmless(const std::string& name) {
-  return name == "lock" || name == "lost+found";
+// What can stand in a directory that is to become a device: it is a disk's own, or a first start was cut short, which
+// makes the lock, the records' directory and the device's files one after the other, and no record before all is there.
+bool isHarmless(const EmbeddedFileManager& files, const std::string& name) {
+  if (name == "lost+found") return true;
+  const std::string path = "/" + name;
+  if (name == "lock") return !files.isDirectory(path) && files.treeSize(path) == 0;
+  if (name != "state" && name != "var") return false;
+  const auto names = files.contentsOfDirectory(path, nullptr);
+  return names && names->empty();
 }
 
 // Makes the directory with its parents, on the machine. 0 or an error number.
@@ -92,9 +98,12 @@ std::optional<DeviceDirectory> lookAtDeviceDirectory(const std::string& director
                                 reason));
     return std::nullopt;
   }
-  if (files.isDirectory("/state") || files.isDirectory("/var/mobile")) return DeviceDirectory::Device;
-  const bool isEmpty = std::all_of(names->begin(), names->end(), isHarmless);
-  return isEmpty ? DeviceDirectory::Empty : DeviceDirectory::SomethingElse;
+  // In this order: another process may be making the device just now.
+  const bool isEmpty =
+      std::all_of(names->begin(), names->end(), [&](const std::string& name) { return isHarmless(files, name); });
+  if (isEmpty) return DeviceDirectory::Empty;
+  const bool isDevice = files.isDirectory("/state") && files.isDirectory("/var/mobile");
+  return isDevice ? DeviceDirectory::Device : DeviceDirectory::SomethingElse;
 }
 
 OwnedFile prepareDeviceDirectory(const std::string& directory, Disk& disk, ErrorOut error) {

@@ -680,8 +680,8 @@ TEST_F(DeviceTest, WhatIsNoDeviceIsLeftAlone) {
   expectRefused(kDeviceUnusable, "is no directory");
   fs::remove(root);
   put(root + "/state/x.plist", "x");
-  put(root + "/var", "a file where a directory belongs");
-  expectRefused(kDeviceUnusable, "/var");
+  put(root + "/var/mobile/tmp", "a file where a directory belongs");
+  expectRefused(kDeviceUnusable, "/var/mobile/tmp");
 }
 
 TEST_F(DeviceTest, FirstStartThatIsCutShortCanBeDoneAgain) {
@@ -787,6 +787,23 @@ TEST_F(DeviceTest, BadSeedChangesNothing) {
     EXPECT_NE(error->text().find(key), std::string::npos) << error->description();
     EXPECT_EQ(tree(root), before) << key;
   }
+}
+
+// Other programs have a "state" or a "var" too.
+TEST_F(DeviceTest, DirectoriesThatOnlyLookLikeADeviceAreLeftAlone) {
+  for (const char* file : {"/state/app.plist", "/var/mobile/notes.txt", "/var/log/messages", "/lock/x"}) {
+    fs::remove_all(root);
+    put(root + file, "somebody's own");
+    const auto before = tree(top);
+    expectRefused(kDeviceUnusable, "name an empty or new directory");
+    std::optional<Error> error;
+    EXPECT_TRUE(!Device::status(root, &error) && error->description().find(root) != std::string::npos) << file;
+    EXPECT_EQ(tree(top), before) << file;
+  }
+  fs::remove_all(root);
+  for (const char* directory : {"/state", "/var"}) fs::create_directories(root + directory);
+  put(root + "/lock", "");
+  EXPECT_TRUE(open()) << "what a first start made that was cut short";
 }
 
 }  // namespace
