@@ -229,6 +229,9 @@ class EmbeddedCoordination : public OstrelService {
   std::function<std::optional<Error>(const std::string& bundleID)> _installGate APPSYNC_GUARDED_BY(_mutex);
 };
 
+// Whether a record of the state store that is to be a coordinator's can be read as one; every other record can.
+bool isCoordinatorRecord(const std::string& name, const PropertyList& record);
+
 // What `Device::status` shows under "coordinators": an array with a dictionary for each, "identifier", "kind"
 // ("initiating", "updating", "restoring", "restoring-demoted"), "creator", "error" (a text; absent while it lives),
 // "responsibleClient" (absent when nobody has been named), "installOptions", "initialAssetPromises",

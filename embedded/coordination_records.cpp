@@ -1,3 +1,4 @@
+#include <algorithm>
 #include <array>
 #include <utility>
 
@@ -51,8 +52,9 @@ PropertyList recordOf(const Error& error) {
 std::optional<Error> errorFrom(const PropertyList* chain) {
   if (chain == nullptr) return std::nullopt;
   std::optional<Error> error;
-  for (std::size_t i = chain->count(); i-- > 0;) {
-    const PropertyList& link = chain->elements()[i];
+  const auto links = chain->elements();
+  for (std::size_t i = std::min(links.size(), kLongestErrorChain); i-- > 0;) {
+    const PropertyList& link = links[i];
     const PropertyList* code = link.find("Code");
     const std::string domain = textIn(link, "Domain").value_or(std::string(kOstrelErrorDomain));
     const std::int64_t value = code != nullptr ? code->integer().value_or(0) : 0;
@@ -194,17 +196,13 @@ bool isInstalled(const InstallCoordinator& coordinator, const std::optional<Pell
 }  // namespace
 
 // A crash can have come between two steps: a placeholder that is not in the registry is installed once more, and that
-// of a dead coordinator goes. A record that says nothing is dropped.
+// of a dead coordinator goes.
 void EmbeddedCoordination::loadRecords() {
   for (const std::string& bundleID : _store.keys(std::string(kCollection))) {
     const std::string name = coordinatorRecordName(bundleID);
     const auto record = _store.load(name, nullptr);
-    if (!record) continue;
-    const auto coordinator = coordinatorFromRecord(bundleID, *record);
-    if (!coordinator) {
-      _store.remove(name, nullptr);
-      continue;
-    }
+    const auto coordinator = record ? coordinatorFromRecord(bundleID, *record) : nullptr;
+    if (!coordinator) continue;
     coordinator->isPlaceholderInstalled =
         isInstalled(*coordinator, _registry.applicationProxyForIdentifier(bundleID, true));
     if (!coordinator->isLive() && coordinator->isPlaceholderInstalled) {
@@ -213,6 +211,11 @@ void EmbeddedCoordination::loadRecords() {
     }
     _coordinators[bundleID] = coordinator;
   }
+}
+
+bool isCoordinatorRecord(const std::string& name, const PropertyList& record) {
+  const std::string prefix = coordinatorRecordName("");
+  return !name.starts_with(prefix) || coordinatorFromRecord(name.substr(prefix.size()), record) != nullptr;
 }
 
 // --- status ---------------------------------------------------------------------------------------------------------

@@ -80,7 +80,7 @@ std::unique_ptr<Device> Device::open(const DeviceOptions& options, ErrorOut erro
   EmbeddedFileManager files(directory, disk);
   files.removeLeftTemporaryFiles();
   std::optional<Error> reason;
-  if (!repairStateRecords(files, ground.repairs, &reason)) {
+  if (!repairStateRecords(files, isCoordinatorRecord, ground.repairs, &reason)) {
     setError(error, deviceError(kDeviceUnusable,
                                 "The records of the device in \"" + directory +
                                     "\" cannot be read; make them readable, or move the directory away",

@@ -27,6 +27,11 @@ std::string pathOfRecord(const std::string& name) {
   return std::string(kStateDirectory) + "/" + name + std::string(kRecordSuffix);
 }
 
+std::string nameOfRecord(const std::string& path) {
+  const std::size_t begin = std::string_view(kStateDirectory).size() + 1;
+  return path.substr(begin, path.size() - kRecordSuffix.size() - begin);
+}
+
 Error refusedName(const std::string& name) {
   return Error(std::string(kFileErrorDomain), EINVAL, "\"" + name + "\" cannot be the name of a record");
 }
@@ -98,10 +103,15 @@ class FileStateStore : public StateStore {
   mutable EmbeddedFileManager _files;  // reading changes nothing in it
 };
 
-bool repairRecord(EmbeddedFileManager& files, const std::string& path, std::vector<std::string>& repairs,
-                  ErrorOut error) {
+bool repairRecord(EmbeddedFileManager& files, const std::string& path, const RecordCheck& isMeaningful,
+                  std::vector<std::string>& repairs, ErrorOut error) {
   std::optional<Error> reason;
-  if (readRecord(files, path, &reason) || !reason) return true;
+  const std::optional<PropertyList> record = readRecord(files, path, &reason);
+  if (record && !isMeaningful(nameOfRecord(path), *record)) {
+    reason = Error(std::string(kFileErrorDomain), EILSEQ,
+                   "The record \"" + files.hostPath(path) + "\" does not say what it must");
+  }
+  if (!reason) return true;
   const std::string aside = path + std::string(kDamagedSuffix);
   files.removeItem(aside, nullptr);
   if (!files.moveItem(path, aside, error)) return false;
@@ -111,15 +121,15 @@ bool repairRecord(EmbeddedFileManager& files, const std::string& path, std::vect
 }
 
 bool repairRecordsIn(EmbeddedFileManager& files, const std::string& directory, int depth,
-                     std::vector<std::string>& repairs, ErrorOut error) {
+                     const RecordCheck& isMeaningful, std::vector<std::string>& repairs, ErrorOut error) {
   const auto names = files.contentsOfDirectory(directory, error);
   if (!names) return false;
   for (const std::string& name : *names) {
     const std::string path = std::string(directory).append("/").append(name);
     if (name.ends_with(kRecordSuffix)) {
-      if (!repairRecord(files, path, repairs, error)) return false;
+      if (!repairRecord(files, path, isMeaningful, repairs, error)) return false;
     } else if (depth > 0 && files.isDirectory(path)) {
-      if (!repairRecordsIn(files, path, depth - 1, repairs, error)) return false;
+      if (!repairRecordsIn(files, path, depth - 1, isMeaningful, repairs, error)) return false;
     }
   }
   return true;
@@ -131,9 +141,10 @@ std::unique_ptr<StateStore> makeFileStateStore(EmbeddedFileManager& files) {
   return std::make_unique<FileStateStore>(files);
 }
 
-bool repairStateRecords(EmbeddedFileManager& files, std::vector<std::string>& repairs, ErrorOut error) {
+bool repairStateRecords(EmbeddedFileManager& files, const RecordCheck& isMeaningful, std::vector<std::string>& repairs,
+                        ErrorOut error) {
   EmbeddedFileManager own = files.ownFiles();
-  return repairRecordsIn(own, kStateDirectory, 1, repairs, error);
+  return repairRecordsIn(own, kStateDirectory, 1, isMeaningful, repairs, error);
 }
 
 bool isSinglePathComponent(const std::string& text) {

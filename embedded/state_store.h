@@ -3,6 +3,7 @@
 // A record's name is "COLLECTION/KEY" or a single word; a key is a bundle identifier or another single path component.
 #pragma once
 
+#include <functional>
 #include <memory>
 #include <optional>
 #include <string>
@@ -36,9 +37,14 @@ class StateStore {
 // with the first record in them. Errors name the file.
 std::unique_ptr<StateStore> makeFileStateStore(EmbeddedFileManager& files);
 
-// Reads every record, and moves one that cannot be read aside to NAME.plist.damaged, so that its service goes on
-// without it. Appends a line for each to `repairs`; false, with an error, when one can be neither read nor moved.
-bool repairStateRecords(EmbeddedFileManager& files, std::vector<std::string>& repairs, ErrorOut error);
+// Whether a record means something to its service.
+using RecordCheck = std::function<bool(const std::string& name, const PropertyList& record)>;
+
+// Reads every record, and moves one that cannot be read or means nothing aside to NAME.plist.damaged, so that its
+// service goes on without it. Appends a line for each to `repairs`; false, with an error, when one can be neither read
+// nor moved.
+bool repairStateRecords(EmbeddedFileManager& files, const RecordCheck& isMeaningful, std::vector<std::string>& repairs,
+                        ErrorOut error);
 
 // Whether this can be the name of one file or directory of an application: not empty, not "." or "..", no "/" and no
 // NUL, valid UTF-8 and at most 200 bytes. The services of the device refuse every other bundle identifier.

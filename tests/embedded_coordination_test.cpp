@@ -1,7 +1,6 @@
 #include <gtest/gtest.h>
 
 #include <filesystem>
-#include <fstream>
 #include <mutex>
 #include <thread>
 
@@ -253,7 +252,6 @@ TEST_F(EmbeddedCoordinationTest, ASeedIsWhatStatusShows) {
   EXPECT_EQ(bare.coordinators().elements()[0], full);
   const PropertyList shown = bare.coordinators();
   ASSERT_TRUE(bare.coordination().seed(shown, nullptr));
-  std::ofstream(bare.directory + "/state/coordinators/org.damaged.plist") << "<plist><dict/></plist>";
   bare.start();
   bare.settle();
   EXPECT_EQ(bare.coordinators(), shown);
@@ -271,6 +269,29 @@ TEST_F(EmbeddedCoordinationTest, ASeedIsWhatStatusShows) {
     EXPECT_FALSE(checkCoordinationSeed(PropertyList::array({waiting, bad}), &error)) << bad.description();
     EXPECT_TRUE(error && error->text().find("coordinators[1]") == 0);
   }
+}
+
+TEST_F(EmbeddedCoordinationTest, StrangeRecordsAreNeitherLostNorBelieved) {
+  const auto put = [&](const char* bundleID, const PropertyList& record) {
+    EXPECT_TRUE(
+        makeFileStateStore(bare.device->files())->save(std::string("coordinators/") + bundleID, record, nullptr));
+  };
+  const PropertyList sound =
+      PropertyList::dictionary({{"Kind", "updating"}, {"Creator", PropertyList::unsignedInteger(3)}});
+  PropertyList deep = sound;
+  PropertyList odd = sound;
+  deep.set("Error", PropertyList::array(std::vector<PropertyList>(300'000, PropertyList::dictionary({{"Text", "t"}}))));
+  odd.set("Error", PropertyList::dictionary({{"Text", "t"}}));
+  put("org.deep", deep);
+  put("org.odd", odd);
+  put("org.kindless", PropertyList::dictionary({{"Creator", PropertyList::unsignedInteger(3)}}));
+  EXPECT_EQ(bare.coordinators().count(), 2U);
+  bare.start();
+  EXPECT_EQ(bare.coordinators().count(), 2U);
+  EXPECT_TRUE(client().coordinator(Kind::Any, "org.deep", false).error());
+  ASSERT_EQ(bare.device->repairs().size(), 1U);
+  EXPECT_NE(bare.device->repairs()[0].find("org.kindless.plist.damaged"), std::string::npos);
+  EXPECT_TRUE(std::filesystem::exists(bare.directory + "/state/coordinators/org.kindless.plist.damaged"));
 }
 
 }  // namespace
