@@ -359,9 +359,9 @@ PropertyList recordFromSeed(const PropertyList& entry, bool isPlaceholderInstall
 
 bool checkCoordinationSeed(const PropertyList& coordinators, ErrorOut error) {
   if (!coordinators.isArray()) return refuseSeed(error, "\"coordinators\"", "must be an array");
-  std::size_t index = 0;
+  std::size_t number = 0;
   for (const PropertyList& entry : coordinators.elements()) {
-    const std::string where = "coordinators[" + std::to_string(index++) + "]";
+    const std::string where = "entry " + std::to_string(++number);
     const auto identifier = textIn(entry, "identifier");
     if (!checkEntry(entry, identifier ? where + " (" + *identifier + ")" : where, error)) return false;
   }

@@ -187,16 +187,18 @@ PropertyList uninstalledStatus(const StateStore& store) {
 }
 
 bool checkUninstalledSeed(const PropertyList& identifiers, ErrorOut error) {
-  std::size_t fitting = 0;
+  const auto refuse = [&](const std::string& text) {
+    setError(error, Error(std::string(kDeviceErrorDomain), kDeviceBadSeed, text));
+    return false;
+  };
+  if (!identifiers.isArray()) return refuse("uninstalled must be an array of bundle identifiers");
+  std::size_t number = 0;
   for (const PropertyList& identifier : identifiers.elements()) {
-    if (!isSinglePathComponent(identifier.string().value_or(""))) break;
-    ++fitting;
+    ++number;
+    if (isSinglePathComponent(identifier.string().value_or(""))) continue;
+    return refuse("entry " + std::to_string(number) + " must be a bundle identifier");
   }
-  if (identifiers.isArray() && fitting == identifiers.count()) return true;
-  std::string text = "uninstalled must be an array of bundle identifiers";
-  if (identifiers.isArray()) text += "; its entry " + std::to_string(fitting) + " is none";
-  setError(error, Error(std::string(kDeviceErrorDomain), kDeviceBadSeed, std::move(text)));
-  return false;
+  return true;
 }
 
 bool seedUninstalled(EmbeddedInstaller& installer, const PropertyList& identifiers, ErrorOut error) {

@@ -20,19 +20,28 @@ constexpr std::uint64_t kLargestFile = 1ULL << 40;
 
 enum class Wanted : std::uint8_t { Text, Number, Size, Flag, Dictionary, ApplicationType, FileSizes };
 
+enum class Entry : std::uint8_t { Any, Application, Placeholder };
+
+// What an entry can have beside its identifier: what a device's status shows of it, and what only a seed can say.
 struct Field {
   std::string_view key;
   Wanted wanted;
+  Entry entry = Entry::Any;
 };
 
-constexpr std::array kInstallFields = {Field{"installState", Wanted::Number}, Field{"installPhase", Wanted::Number},
-                                       Field{"prioritized", Wanted::Flag}, Field{"progress", Wanted::Flag}};
-constexpr std::array kCommonFields = {Field{"version", Wanted::Text}, Field{"name", Wanted::Text},
-                                      Field{"type", Wanted::ApplicationType}};
-constexpr std::array kInstalledFields = {Field{"size", Wanted::Size}, Field{"files", Wanted::FileSizes},
-                                         Field{"storeMetadata", Wanted::Dictionary}};
-constexpr std::array kPlaceholderFields = {Field{"installType", Wanted::Number},
-                                           Field{"launchProhibited", Wanted::Flag}};
+constexpr std::array kFields = {Field{"version", Wanted::Text},
+                                Field{"name", Wanted::Text},
+                                Field{"type", Wanted::ApplicationType},
+                                Field{"size", Wanted::Size, Entry::Application},
+                                Field{"container", Wanted::Text, Entry::Application},  // a new one is made
+                                Field{"files", Wanted::FileSizes, Entry::Application},
+                                Field{"storeMetadata", Wanted::Dictionary, Entry::Application},
+                                Field{"installType", Wanted::Number, Entry::Placeholder},
+                                Field{"launchProhibited", Wanted::Flag, Entry::Placeholder},
+                                Field{"installState", Wanted::Number},
+                                Field{"installPhase", Wanted::Number},
+                                Field{"prioritized", Wanted::Flag},
+                                Field{"progress", Wanted::Flag}};
 
 // A place below the bundle at which a seed may put a file.
 bool isInnerPath(std::string_view path) {
@@ -81,38 +90,41 @@ std::string_view complaint(const PropertyList& value, Wanted wanted) {
   return "";
 }
 
-template <std::size_t N>
-bool checkFields(const PropertyList& entry, const std::array<Field, N>& fields, const std::string& where,
-                 ErrorOut error) {
-  return std::all_of(fields.begin(), fields.end(), [&](const Field& field) {
-    const PropertyList* value = entry.find(field.key);
-    const std::string_view wrong = value == nullptr ? "" : complaint(*value, field.wanted);
-    if (wrong.empty()) return true;
-    setError(error, Error(std::string(kDeviceErrorDomain), kDeviceBadSeed,
-                          where + ": \"" + std::string(field.key) + "\" " + std::string(wrong)));
-    return false;
-  });
+bool canHave(Entry entry, const Field& field) {
+  return field.entry == Entry::Any || field.entry == entry;
 }
 
-template <std::size_t N>
-bool checkEntries(const std::string& list, const PropertyList& entries, const std::array<Field, N>& fields,
-                  ErrorOut error) {
+std::string unknownKey(Entry entry) {
+  std::string known = "identifier";
+  for (const Field& field : kFields) known += canHave(entry, field) ? ", " + std::string(field.key) : "";
+  return "is nothing that an entry has; there are " + known;
+}
+
+// What is wrong with the value under a key; empty: nothing.
+std::string complaint(const PropertyList::Member& member, Entry entry) {
+  if (member.key == "identifier") return "";
+  const auto* const field =
+      std::ranges::find_if(kFields, [&](const Field& each) { return each.key == member.key && canHave(entry, each); });
+  return field == kFields.end() ? unknownKey(entry) : std::string(complaint(member.value, field->wanted));
+}
+
+bool checkEntries(const std::string& list, const PropertyList& entries, Entry kind, ErrorOut error) {
   const auto refuse = [&](const std::string& text) {
     setError(error, Error(std::string(kDeviceErrorDomain), kDeviceBadSeed, text));
     return false;
   };
   if (!entries.isArray()) return refuse(list + " must be an array of dictionaries");
-  std::size_t index = 0;
+  std::size_t number = 0;
   for (const PropertyList& entry : entries.elements()) {
-    std::string where = list + "[" + std::to_string(index++) + "]";
-    const PropertyList* identifier = entry.find("identifier");
-    if (identifier == nullptr || !isSinglePathComponent(identifier->string().value_or(""))) {
+    const std::string where = "entry " + std::to_string(++number);
+    const std::string identifier = textIn(entry, "identifier").value_or("");
+    if (!isSinglePathComponent(identifier)) {
       return refuse(where + " must be a dictionary whose \"identifier\" is a bundle identifier");
     }
-    where += " (" + *identifier->string() + ")";
-    if (!checkFields(entry, kCommonFields, where, error) || !checkFields(entry, kInstallFields, where, error) ||
-        !checkFields(entry, fields, where, error)) {
-      return false;
+    for (const PropertyList::Member& member : entry.members()) {
+      const std::string wrong = complaint(member, kind);
+      if (wrong.empty()) continue;
+      return refuse(where + " (" + identifier + "): \"" + std::string(member.key) + "\" " + wrong);
     }
   }
   return true;
@@ -190,11 +202,11 @@ PropertyList registryPlaceholdersStatus(const StateStore& store) {
 }
 
 bool checkInstalledSeed(const PropertyList& entries, ErrorOut error) {
-  return checkEntries("installed", entries, kInstalledFields, error);
+  return checkEntries("installed", entries, Entry::Application, error);
 }
 
 bool checkPlaceholdersSeed(const PropertyList& entries, ErrorOut error) {
-  return checkEntries("placeholders", entries, kPlaceholderFields, error);
+  return checkEntries("placeholders", entries, Entry::Placeholder, error);
 }
 
 bool seedInstalled(EmbeddedRegistry& registry, EmbeddedFileManager& files, const PropertyList& entries,

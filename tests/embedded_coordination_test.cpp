@@ -267,7 +267,7 @@ TEST_F(EmbeddedCoordinationTest, ASeedIsWhatStatusShows) {
                                   PropertyList("org.a"), PropertyList::dictionary({{"kind", "updating"}})}) {
     std::optional<Error> error;
     EXPECT_FALSE(checkCoordinationSeed(PropertyList::array({waiting, bad}), &error)) << bad.description();
-    EXPECT_TRUE(error && error->text().find("coordinators[1]") == 0);
+    EXPECT_TRUE(error && error->text().find("entry 2") == 0);
   }
 }
 

@@ -343,8 +343,10 @@ TEST(RegistrySeed, badEntriesAreNamed) {
       {files(number("../x", 1)), "\"files\""},
       {files(number("x", 1) + number("x/y", 1)), "\"files\""},
       {files(number("Info.plist", 1)), "\"files\""},
-      {text("identifier", "../b"), "installed[1]"},
-      {text("identifier", ""), "installed[1]"}};
+      {number("sise", 1), "entry 2 (org.a): \"sise\" is nothing that an entry has; there are identifier, version"},
+      {number("installType", 1), "\"installType\" is nothing"},
+      {text("identifier", "../b"), "entry 2 must"},
+      {text("identifier", ""), "entry 2 must"}};
   std::optional<Error> error;
   for (const auto& [fields, expected] : bad) {
     EXPECT_FALSE(checkInstalledSeed(PropertyList::array({entry("org.z"), entry("org.a", fields)}), &error));
