@@ -37,7 +37,7 @@ std::uint64_t serialOf(const std::string& path) {
   const std::string name = lastComponent(path);
   std::uint64_t serial = 0;
   const auto [end, problem] = std::from_chars(name.data(), name.data() + name.size(), serial);
-  return problem == std::errc() && end == name.data() + name.size() && serial < UINT64_MAX / 2 ? serial : 0;
+  return problem == std::errc() && end == name.data() + name.size() && serial < kSerialLimit ? serial : 0;
 }
 
 // What a placeholder's bundle says of itself: what the application's would, as far as it is known, and of the files
@@ -304,7 +304,12 @@ std::uint64_t EmbeddedRegistry::arrivalOf(const std::string& bundleID) {
 // --- containers -----------------------------------------------------------------------------------------------------
 
 std::string EmbeddedRegistry::newContainerName() {
-  return std::to_string(_nextSerial.fetch_add(1));
+  while (true) {
+    const std::string name = std::to_string(_nextSerial.fetch_add(1));
+    const bool isTaken = _files.fileExists(std::string(kContainersDirectory).append("/").append(name)) ||
+                         _files.fileExists(std::string(kPlaceholdersDirectory).append("/").append(name));
+    if (!isTaken) return name;
+  }
 }
 
 bool EmbeddedRegistry::makePlaceholderContainer(const PlaceholderDescription& description, std::string& path,

@@ -103,7 +103,7 @@ class EmbeddedRegistry : public PellumApplicationWorkspace {
   // Tells every observer that the install of this application has been cancelled.
   void installsDidCancel(const std::string& bundleID);
 
-  // The name for a new container: a number that no container has had in this process, larger than all that are there.
+  // The name for a new container: a number that no container has had in this process and none has now.
   std::string newContainerName();
 
   // Every identifier that is on the device, installed or as a placeholder, in the order in which they came.

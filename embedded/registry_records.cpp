@@ -13,6 +13,11 @@ namespace {
 constexpr char kApplications[] = "applications";
 constexpr char kPlaceholders[] = "placeholders";
 
+std::uint64_t arrivalIn(const PropertyList& stored) {
+  const std::uint64_t arrival = numberIn(stored, "arrival").value_or(0);
+  return arrival < kSerialLimit ? arrival : 0;
+}
+
 // Whether this is the path of a container in that directory, and of nothing else: what a record names is removed with
 // it.
 bool isContainerIn(std::string_view directory, const std::string& path) {
@@ -100,7 +105,7 @@ std::optional<ApplicationRecord> applicationRecord(const std::string& bundleID, 
   record.application.bundlePath = textIn(stored, "bundle").value_or("");
   record.application.size = numberIn(stored, "size").value_or(0);
   record.application.seeded = seededInstallIn(stored);
-  record.arrival = numberIn(stored, "arrival").value_or(0);
+  record.arrival = arrivalIn(stored);
   record.replacedPlaceholder = textIn(stored, "replacedPlaceholder").value_or("");
   if (!isContainerIn(kContainersDirectory, record.application.containerPath)) return std::nullopt;
   return record;
@@ -140,7 +145,7 @@ std::optional<PlaceholderRecord> placeholderRecord(const std::string& bundleID, 
   record.bundleVersion = textIn(stored, "version");
   record.launchProhibited = isTrueIn(stored, "launchProhibited");
   record.containerPath = textIn(stored, "container").value_or("");
-  record.arrival = numberIn(stored, "arrival").value_or(0);
+  record.arrival = arrivalIn(stored);
   record.seeded = seededInstallIn(stored);
   if (!isContainerIn(kPlaceholdersDirectory, record.containerPath)) return std::nullopt;
   return record;

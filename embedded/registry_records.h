@@ -31,6 +31,9 @@ struct SeededInstall {
 std::optional<SeededInstall> seededInstallIn(const PropertyList& record);
 void setSeededInstall(PropertyList& record, const std::optional<SeededInstall>& seeded);
 
+// Containers and arrivals are numbered from 1. A number from here on counts as none, so that numbering never ends.
+inline constexpr std::uint64_t kSerialLimit = UINT64_MAX / 2;
+
 // An installed application, as the installer hands it over.
 struct InstalledApplication {
   std::string bundleID;

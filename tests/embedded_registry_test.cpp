@@ -181,6 +181,28 @@ TEST(Registry, sweepsOnlyWhatNoRecordNames) {
   EXPECT_FALSE(device.registry->applicationIsInstalled("org.a"));
 }
 
+// Whatever a record or a directory's name says, numbering goes on, and to a name that is free.
+TEST(Registry, numberingSurvivesTheLargestNumbers) {
+  constexpr std::uint64_t kLargestCounted = UINT64_MAX / 2 - 1;
+  for (const std::uint64_t arrival : {UINT64_MAX, kLargestCounted}) {
+    RegistryDevice device;
+    seed(device, {entry("org.a")}, {});
+    PropertyList record = *device.store->load("applications/org.a", nullptr);
+    record.set("arrival", PropertyList::unsignedInteger(arrival));
+    ASSERT_TRUE(device.store->save("applications/org.a", record, nullptr));
+    for (const char* parent : {kContainersDirectory, kPlaceholdersDirectory}) {
+      device.files->createDirectory(std::string(parent) + "/" + std::to_string(kLargestCounted + 1), true, {}, nullptr);
+    }
+    ASSERT_TRUE(device.store->save("placeholders/org.meaningless", PropertyList::dictionary(), nullptr));  // no sweep
+    device.restart();
+    seed(device, {entry("org.b"), entry("org.c")}, {entry("org.d")});
+    const std::vector<std::string> last = {"org.b", "org.c", "org.d"};
+    auto order = device.registry->identifiersByArrival();
+    std::erase(order, "org.a");
+    EXPECT_EQ(order, last);
+  }
+}
+
 // --- observers ------------------------------------------------------------------------------------------------------
 
 TEST(Registry, everyLiveInstallIsInExactlyOneList) {
