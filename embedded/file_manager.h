@@ -35,7 +35,8 @@ class FileSink {
   // False, with an error, ends it: nothing appears any more.
   bool append(const void* bytes, std::size_t size, ErrorOut error);
 
-  // Flushes, puts it in place and flushes the directory. False, with an error, leaves an older file as it was.
+  // Flushes, puts it in place and flushes the directory. False, with an error, leaves an older file as it was, unless
+  // it was the last of these that failed.
   bool finish(ErrorOut error);
 
  private:

@@ -23,7 +23,8 @@ class StateStore {
 
   // None when there is no such record or it cannot be read; only the latter sets the error.
   virtual std::optional<PropertyList> load(const std::string& name, ErrorOut error) const = 0;
-  // Durable when it answers true; false leaves the old record.
+  // Durable when it answers true. False, with an error, leaves the old record, unless the new one had got its place and
+  // could then not be flushed: it is what `load` answers from now on, and may be lost with power.
   virtual bool save(const std::string& name, const PropertyList& value, ErrorOut error) = 0;
   // A record that is not there is no failure.
   virtual bool remove(const std::string& name, ErrorOut error) = 0;

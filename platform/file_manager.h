@@ -46,7 +46,8 @@ class FileManager {
   virtual std::optional<Bytes> readFile(const std::string& path, ErrorOut error) = 0;
 
   // Replaces or makes the file in one step: whoever reads sees the old bytes or the new ones, also after a crash or
-  // loss of power at any instant. False, with an error, leaves the old file as it was.
+  // loss of power at any instant. False, with an error, leaves the old file as it was, unless the new one had got its
+  // place and could then not be flushed: it is what everybody reads from now on, and may be lost with power.
   virtual bool writeFile(const std::string& path, BytesView bytes, ErrorOut error) = 0;
 
   // Makes the file with these bytes and attributes; a file that is there is overwritten.
