@@ -74,13 +74,12 @@ std::vector<Row> rowsOf(const SyncReport& report) {
 }
 
 std::string summaryOf(const SyncReport& report) {
-  const auto failed = static_cast<std::size_t>(std::count_if(report.applications.begin(), report.applications.end(),
-                                                             [](const auto& one) { return one.error.has_value(); }));
-  const auto installed =
-      static_cast<std::size_t>(std::count_if(report.applications.begin(), report.applications.end(),
-                                             [](const auto& one) { return one.operation == "INSTALLED"; }));
-  const auto removed = static_cast<std::size_t>(std::count_if(report.removals.begin(), report.removals.end(),
-                                                              [](const auto& one) { return !one.error.has_value(); }));
+  const auto hasFailed = [](const SyncReport::Entry& one) { return one.error.has_value(); };
+  const auto notRemoved = std::count_if(report.removals.begin(), report.removals.end(), hasFailed);
+  const auto failed = std::count_if(report.applications.begin(), report.applications.end(), hasFailed) + notRemoved;
+  const auto installed = std::count_if(report.applications.begin(), report.applications.end(),
+                                       [](const auto& one) { return one.operation == "INSTALLED"; });
+  const auto removed = static_cast<std::ptrdiff_t>(report.removals.size()) - notRemoved;
   std::array<char, 32> seconds{};
   std::snprintf(seconds.data(), seconds.size(), "%.1f s", report.seconds);
   return std::to_string(installed) + " installed, " + std::to_string(removed) + " removed, " +

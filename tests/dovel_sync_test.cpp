@@ -138,6 +138,16 @@ TEST_F(SyncTest, EveryListedAndRequestedApplicationIsReportedOnce) {
       << result.dump(1);
 }
 
+TEST_F(SyncTest, ARemovalThatFailsIsToldAndCounted) {
+  seed(R"({"installed": [{"identifier": "org.x"}, {"identifier": "org.z"}]})");
+  const Outcome run =
+      sync(hostWith({removal("org.x"), removal("org.z")}), {"--fault", "uninstallAppWithBundleID=org.x"});
+  EXPECT_EQ(run.status, 1);
+  EXPECT_EQ(run.out.substr(0, run.out.rfind(" in ")),
+            "\norg.x  not removed  FaultError 1: uninstallAppWithBundleID was made to fail\n\n"
+            "0 installed, 1 removed, 0 skipped, 1 failed");
+}
+
 TEST_F(SyncTest, AListOrADeviceThatCannotBeUsedIsNoSuccess) {
   struct Case {
     const char* list;
