@@ -349,7 +349,8 @@ void WrappedCoordination::setObserver(OstrelRef coordinator, const Observer& obs
 OstrelRef WrappedCoordination::addInstallObserver(const std::string& machServiceName,
                                                   const std::set<OstrelClientID>& clients, const Observer& observer) {
   const auto forward = [&](ErrorOut) {
-    const auto between = std::make_shared<ObserverOfCoordinators>(observer, *this);
+    Observer between;
+    if (observer) between = std::make_shared<ObserverOfCoordinators>(observer, *this);
     const OstrelRef registration = _bare.addInstallObserver(machServiceName, clients, between);
     NamedRef given = _references.give(registration, "observer", machServiceName, "");
     _references.setOwner(registration, between.get());
