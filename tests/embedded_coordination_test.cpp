@@ -220,6 +220,113 @@ TEST_F(EmbeddedCoordinationTest, KeepsTheIconThatWasHandedOver) {
   EXPECT_EQ(client().files().readFile(shown->bundleURL->path() + "/Icon.png", nullptr), (Bytes{1, 2}));
 }
 
+// All that was handed over is the service's from then on, whoever asked for it having long gone.
+TEST_F(EmbeddedCoordinationTest, WhatWasHandedOverOutlivesTheProcess) {
+  const auto metadata = [](const char* title) {
+    return KilnStoreMetadata::initWithDictionary(PropertyList::dictionary({{"title", title}}));
+  };
+  {
+    const auto held = client().coordinator(Kind::Restoring, "org.a", true);
+    KilnInstallOptions options;
+    options.setTarvoMetadata(metadata("application"));
+    options.setPellumInstallType(2);
+    options.setInstallTargetType(1);
+    const std::string path = client().files().temporaryDirectory() + "/Icon.png";
+    client().files().createFile(path, Bytes{1, 2}, {});
+    const auto icon = OstrelPromisedTransferToPath::initWithName(client().service(), "org.a-Icon", 3,
+                                                                 FileURL::fileURLWithPath(path, false), 2);
+    icon.setComplete(true);
+    const auto placeholder = client().placeholder("org.a", kPellumInstallTypeRestore);
+    auto attributes = OstrelPlaceholderAttributes::initWithInfoPlistDictionary(PropertyList::dictionary({{"k", "v"}}));
+    attributes.setBundleVersion("7");
+    attributes.setLaunchProhibited(true);
+    ASSERT_TRUE(placeholder.setIconPromise(icon, nullptr) && placeholder.setMetadata(metadata("shown"), nullptr));
+    ASSERT_TRUE(placeholder.setPlaceholderAttributes(attributes, nullptr) && held.setInstallOptions(options, nullptr));
+    ASSERT_TRUE(held.setAppAssetPromise(client().promise("org.a-Asset"), nullptr));
+    ASSERT_TRUE(held.setUserDataPromise(client().promise("org.a-UserData"), nullptr));
+    ASSERT_TRUE(client().service().setAppAssetPromiseResponsibleClient(held.ref(), OstrelClientMerc, nullptr));
+    ASSERT_TRUE(held.setPlaceholderPromise(placeholder, nullptr));
+  }
+  bare.settle();
+  const auto shown = [&] {
+    const auto record = client().registry().applicationProxyForIdentifier("org.a", true);
+    if (!record) return std::string("(none)");
+    std::string all = record->localizedName.value_or("") + std::to_string(record->installType);
+    for (const std::string& path : {record->bundleURL->path() + "/Info.plist", record->bundleURL->path() + "/Icon.png",
+                                    record->bundleContainerURL->path() + "/TarvoMetadata.plist"}) {
+      const auto bytes = client().files().readFile(path, nullptr);
+      all += bytes ? std::string(bytes->begin(), bytes->end()) : "(no " + path + ")";
+    }
+    return all;
+  };
+  const std::string before = shown();
+  const PropertyList status = bare.coordinators();
+  EXPECT_EQ(before.find("(no"), std::string::npos) << before;
+  // As after a crash that came before the registry's record was safe.
+  ASSERT_TRUE(std::filesystem::remove(bare.directory + "/state/placeholders/org.a.plist"));
+  bare.start();
+  bare.settle();
+  EXPECT_EQ(shown(), before);
+  EXPECT_EQ(bare.coordinators(), status);
+  EXPECT_EQ(client().service().description(
+                client().coordinator(Kind::Any, "org.a", false).appAssetPromiseWithError(nullptr).ref()),
+            "<promise org.a-Asset>");
+  {
+    const auto held = client().coordinator(Kind::Restoring, "org.a", false);
+    EXPECT_FALSE(held.setUserDataPromise(client().promise("again"), nullptr));
+    held.appAssetPromiseWithError(nullptr).setTransferPath(
+        FileURL::fileURLWithPath(client().putPackage("org.a", "8"), false));
+    held.appAssetPromiseWithError(nullptr).setComplete(true);
+  }
+  bare.settle();
+  EXPECT_EQ(client().installedVersion("org.a"), std::nullopt) << "the user's data have not come";
+}
+
+TEST_F(EmbeddedCoordinationTest, WhatIsDeadOrGoneUsesNoPackage) {
+  for (const char* bundleID : {"org.a", "org.b"}) {
+    const auto held = client().coordinator(Kind::Initiating, bundleID, true);
+    const auto promise = client().promise(bundleID);
+    promise.setTransferPath(FileURL::fileURLWithPath("/var/mobile/" + std::string(bundleID), false));
+    promise.setComplete(true);
+    ASSERT_TRUE(held.setAppAssetPromise(promise, nullptr));
+  }
+  EXPECT_EQ(bare.coordination().packagePathsInUse(), (Lines{"/var/mobile/org.a", "/var/mobile/org.b"}));
+  bare.coordination().personCancels("org.a", Error("Shell", 2));
+  bare.coordination().personCancels("org.none", Error("Shell", 2));
+  EXPECT_EQ(bare.coordination().packagePathsInUse(), Lines{"/var/mobile/org.b"});
+  bare.settle();
+  bare.start();
+  EXPECT_EQ(bare.coordination().packagePathsInUse(), Lines{"/var/mobile/org.b"});
+  EXPECT_EQ(client().coordinator(Kind::Initiating, "org.a", false).error(), Error("Shell", 2));
+}
+
+// The icon is somebody else's file: what is no small file is left out, and the placeholder comes without.
+TEST_F(EmbeddedCoordinationTest, AnIconThatCannotBeReadIsLeftOut) {
+  const std::string directory = client().files().temporaryDirectory();
+  const std::tuple<const char*, std::string, bool> cases[] = {{"org.unfinished", "Icon.png", false},
+                                                              {"org.missing", "none.png", true},
+                                                              {"org.directory", "", true},
+                                                              {"org.large", "large.png", true},
+                                                              {"org.good", "Icon.png", true}};
+  client().files().createFile(directory + "/Icon.png", Bytes{1, 2}, {});
+  client().files().createFile(directory + "/large.png", Bytes((8U << 20) + 1), {});
+  for (const auto& [bundleID, name, isComplete] : cases) {
+    {
+      const auto held = client().coordinator(Kind::Initiating, bundleID, true);
+      const auto icon = OstrelPromisedTransferToPath::initWithName(
+          client().service(), "icon", 3, FileURL::fileURLWithPath(directory + "/" + name, false), 2);
+      icon.setComplete(isComplete);
+      const auto placeholder = client().placeholder(bundleID);
+      ASSERT_TRUE(placeholder.setIconPromise(icon, nullptr) && held.setPlaceholderPromise(placeholder, nullptr));
+    }
+    bare.settle();
+    const auto record = client().registry().applicationProxyForIdentifier(bundleID, true);
+    ASSERT_TRUE(record) << bundleID;
+    EXPECT_EQ(client().files().fileExists(record->bundleURL->path() + "/Icon.png"), bundleID == std::string("org.good"))
+        << bundleID;
+  }
+}
+
 TEST_F(EmbeddedCoordinationTest, SettlesWhenNothingCanGoOn) {
   auto held = client().coordinator(Kind::Initiating, "org.a", true);
   ASSERT_TRUE(client().configure(held, "org.a"));
