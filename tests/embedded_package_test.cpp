@@ -2,7 +2,9 @@
 #include <gtest/gtest.h>
 #include <sys/stat.h>
 
+#include <algorithm>
 #include <string>
+#include <tuple>
 #include <utility>
 #include <vector>
 
@@ -70,6 +72,51 @@ Bytes archive(const std::vector<Entry>& entries, const std::string& comment = ""
   put(out, {{4, 0x06054B50}, {4, 0}, {2, entries.size()}, {2, entries.size()}, {4, directory.size()}, {4, start}});
   put(out, {{2, comment.size()}});
   out += comment;
+  return {out.begin(), out.end()};
+}
+
+// Which numbers of an archive stand in its extra fields and its second end, and what is wrong with them there.
+struct Large {
+  bool unpacked = false;
+  bool packed = false;
+  bool offset = false;
+  std::string before = {};        // other extra fields
+  std::uint64_t fieldLength = 0;  // other than the right one
+  std::pair<std::size_t, std::uint64_t> change = {
+      0, 0};  // of the 76 bytes of the second end and its locator: place, value
+};
+
+// One that could hold more than 4 GiB, with a directory and two ends.
+Bytes largeArchive(const std::vector<Entry>& entries, const Large& large) {
+  constexpr std::uint64_t kElsewhere = 0xFFFFFFFF;
+  std::string out;
+  std::string directory;
+  for (const Entry& entry : entries) {
+    const std::uint64_t size = entry.content.size();
+    std::string extra;
+    if (large.unpacked) put(extra, {{8, size}});
+    if (large.packed) put(extra, {{8, size}});
+    if (large.offset) put(extra, {{8, out.size()}});
+    std::string fields = large.before;
+    if (!extra.empty()) put(fields, {{2, 1}, {2, large.fieldLength != 0 ? large.fieldLength : extra.size()}});
+    fields += extra;
+    put(directory, {{4, 0x02014B50}, {2, 0x031E}, {2, 45}, {2, 0x800}, {2, 0}, {4, 0}, {4, checksum(entry.content)}});
+    put(directory, {{4, large.packed ? kElsewhere : size}, {4, large.unpacked ? kElsewhere : size}});
+    put(directory, {{2, entry.name.size()}, {2, fields.size()}, {6, 0}, {4, std::uint64_t{entry.mode} << 16}});
+    put(directory, {{4, large.offset ? kElsewhere : out.size()}});
+    directory += entry.name + fields;
+    put(out, {{4, 0x04034B50}, {2, 45}, {2, 0x800}, {2, 0}, {4, 0}, {4, checksum(entry.content)}, {4, size}});
+    put(out, {{4, size}, {2, entry.name.size()}, {2, 0}});
+    out += entry.name + entry.content;
+  }
+  const std::size_t start = out.size();
+  const std::size_t end = start + directory.size();
+  std::string ends;
+  put(ends, {{4, 0x06064B50}, {8, 44}, {2, 45}, {2, 45}, {4, 0}, {4, 0}, {8, entries.size()}, {8, entries.size()}});
+  put(ends, {{8, directory.size()}, {8, start}, {4, 0x07064B50}, {4, 0}, {8, end}, {4, 1}});
+  if (large.change.first != 0) ends[large.change.first] = static_cast<char>(large.change.second);
+  out += directory + ends;
+  put(out, {{4, 0x06054B50}, {4, 0}, {2, 0xFFFF}, {2, 0xFFFF}, {4, kElsewhere}, {4, kElsewhere}, {2, 0}});
   return {out.begin(), out.end()};
 }
 
@@ -178,6 +225,7 @@ std::vector<BadPackage> badPackages() {
       {"Info.plist further down", kInstallerNotAPackage, archive({{app + "B/Info.plist", good}})},
       {"Info.plist that is a link", kInstallerNotAPackage, archive({{app + "I", good}, {info, "I", kLink}})},
       {"Info.plist that is none", kInstallerNotAPackage, archive({{info, "<plist>"}})},
+      {"Info.plist of another kind", kInstallerNotAPackage, archive({{info, "<plist><array/></plist>"}})},
       {"no identifier", kInstallerWrongApplication, archive({{info, "<plist><dict/></plist>"}})},
       {"another application", kInstallerWrongApplication, archive({{info, infoPlist("org.b", "2")}})},
       {"wrong checksum", kInstallerDamaged, plus({{.name = x, .content = "x", .wrongChecksum = 1}})},
@@ -277,6 +325,76 @@ TEST(Package, cancellingLeavesTheOldVersion) {
   EXPECT_GT(asked, 4);
 }
 
+TEST(Package, largeNumbersAreReadWhereTheyStand) {
+  const std::string other("\x55\x54\5\0\1abcd", 9);
+  const std::tuple<const char*, Large, bool> cases[] = {
+      {"plain", {}, true},
+      {"unpacked", {.unpacked = true}, true},
+      {"packed", {.packed = true}, true},
+      {"offset", {.offset = true}, true},
+      {"all", {.unpacked = true, .packed = true, .offset = true}, true},
+      {"behind another field", {.unpacked = true, .offset = true, .before = other}, true},
+      {"another field alone", {.before = other}, true},
+      {"another field that is cut off", {.before = other.substr(0, 7)}, false},
+      {"too short for the offset", {.unpacked = true, .offset = true, .fieldLength = 8}, false},
+      {"too short for the size", {.packed = true, .fieldLength = 4}, false},
+      {"too long", {.unpacked = true, .fieldLength = 9}, false},
+      {"another mark", {.change = {1, 'x'}}, false},
+      {"another disk", {.change = {16, 1}}, false},
+      {"the directory on another disk", {.change = {20, 1}}, false},
+      {"fewer entries on this disk", {.change = {24, 1}}, false},
+      {"fewer entries", {.change = {32, 1}}, false},
+      {"a smaller directory", {.change = {40, 1}}, false},
+      {"another start", {.change = {48, 1}}, false},
+      {"the end on another disk", {.change = {56 + 4, 1}}, false},
+      {"the end behind the file", {.change = {56 + 12, 1}}, false},
+      {"two disks", {.change = {56 + 16, 2}}, false}};
+  for (const auto& [title, large, isGood] : cases) {
+    SCOPED_TRACE(title);
+    RegistryDevice device;
+    ASSERT_TRUE(device.install("org.a", package("1")));
+    std::optional<Error> error;
+    const Bytes bytes = largeArchive(entriesOf("2", {{"Payload/A.app/x", "content"}}), large);
+    EXPECT_EQ(device.install("org.a", bytes, &error), isGood) << (error ? error->description() : "");
+    EXPECT_EQ(device.version("org.a"), isGood ? "2" : "1");
+    if (!isGood) {
+      EXPECT_EQ(error.value_or(Error("", 0)).code(), kInstallerDamaged) << error->description();
+    } else {
+      const auto bundle = device.registry->applicationProxyForIdentifier("org.a", false)->bundleURL->path();
+      EXPECT_EQ(device.text(bundle + "/x"), "content");
+    }
+  }
+}
+
+// What decides at the very end still decides: all has been unpacked by then, and nothing is in place.
+TEST(Package, aCancellationAfterTheLastByteCounts) {
+  RegistryDevice device;
+  ASSERT_TRUE(device.install("org.a", package("1")));
+  device.files->writeFile("/var/mobile/Media/p.ipa", package("2", {{"Payload/A.app/x", "x"}}), nullptr);
+  std::vector<double> told;
+  std::optional<Error> error;
+  EXPECT_FALSE(device.installer->install(
+      "org.a", "/var/mobile/Media/p.ipa", {}, [&](double fraction) { told.push_back(fraction); },
+      [&] { return std::ranges::count(told, 1.0) == 2; }, &error));
+  EXPECT_EQ(error.value_or(Error("", 0)).code(), kInstallerCancelled);
+  EXPECT_EQ(device.version("org.a"), "1");
+  EXPECT_EQ(device.containers().size(), 1U);
+}
+
+TEST(Package, whatIsNotExecutableOrBesideTheBundleIsNotMadeSo) {
+  RegistryDevice device;
+  ASSERT_TRUE(device.install("org.a", package("1", {{"Payload/A.app/plain", "x", S_IFREG | 0666},
+                                                    {"Payload/note.txt", "beside"},
+                                                    {"Payload/.app/x", "no bundle"},
+                                                    {"Payload/A.app/empty", ""}})));
+  const auto bundle = device.registry->applicationProxyForIdentifier("org.a", false)->bundleURL->path();
+  struct stat status {};
+  ASSERT_EQ(::stat(device.files->hostPath(bundle + "/plain").c_str(), &status), 0);
+  EXPECT_EQ(status.st_mode & 07777, 0644U);
+  EXPECT_EQ(device.text(bundle + "/empty"), "");
+  EXPECT_EQ(device.files->contentsOfDirectory(bundle, nullptr)->size(), 3U);
+}
+
 // --- the disk -------------------------------------------------------------------------------------------------------
 
 // Old or new, whole, with the placeholder exactly beside the old one, and nothing else.
@@ -344,6 +462,84 @@ TEST(Installer, remembersWhatWasUninstalled) {
   device.disk.failingCall = 1;
   EXPECT_NE(device.installer->KilnClearUninstalled({"org.c"}), 0);
   EXPECT_EQ(device.installer->KilnLookupUninstalled()->count(), 1U);
+}
+
+TEST(Installer, anUpdateKeepsTheTypeAndFillsAPlaceholdersPlace) {
+  for (const bool hasPlaceholder : {true, false}) {
+    RegistryDevice device;
+    if (hasPlaceholder) {
+      PlaceholderDescription placeholder;
+      placeholder.bundleID = "org.a";
+      placeholder.applicationType = "System";
+      ASSERT_TRUE(device.registry->installPlaceholder(placeholder, nullptr));
+    }
+    for (const char* version : {"1", "2"}) {
+      ASSERT_TRUE(device.install("org.a", package(version)));
+      EXPECT_EQ(device.registry->applicationProxyForIdentifier("org.a", false)->applicationType,
+                hasPlaceholder ? "System" : "User");
+    }
+  }
+}
+
+TEST(Installer, whatIsInstalledAgainIsNotRememberedAnyMore) {
+  RegistryDevice device;
+  ASSERT_TRUE(device.install("org.a", package("1")) && device.installer->uninstall("org.a", nullptr));
+  ASSERT_TRUE(device.install("org.a", package("1")) && device.registry->removeApplication("org.a", nullptr));
+  EXPECT_EQ(device.installer->KilnLookupUninstalled()->count(), 0U) << "it went by another way";
+  device.disk.failingCall = 1;
+  EXPECT_EQ(device.installer->KilnClearUninstalled({"org.a", "org.b"}), 0) << "nothing to forget, nothing to write";
+  EXPECT_EQ(device.disk.failingCall, 1);
+}
+
+// Either it is remembered and gone, or it is there and not remembered, but for a flush that came to nothing.
+TEST(Installer, aRemovalThatFailsHasNotHappened) {
+  int failures = 0;
+  std::size_t remembered = 0;
+  bool isOver = false;
+  for (int call = 1; !isOver; ++call) {
+    ASSERT_LT(call, 100);
+    SCOPED_TRACE(call);
+    RegistryDevice device;
+    ASSERT_TRUE(device.install("org.a", package("1")));
+    device.disk.failingCall = call;
+    std::optional<Error> error;
+    const bool isRemoved = device.installer->uninstall("org.a", &error);
+    isOver = device.disk.failingCall > 0;
+    EXPECT_EQ(isRemoved, !error);
+    EXPECT_NE(device.registry->applicationIsInstalled("org.a"), isRemoved);
+    EXPECT_EQ(device.installer->KilnLookupUninstalled()->count(), isRemoved ? 1U : 0U);
+    if (isRemoved) continue;
+    ++failures;
+    ASSERT_TRUE(device.registry->removeApplication("org.a", nullptr));
+    remembered += uninstalledStatus(*device.store).count();
+  }
+  EXPECT_GT(failures, 4);
+  EXPECT_EQ(remembered, 1U);
+}
+
+TEST(Installer, aListThatCannotBeReadIsNoEmptyList) {
+  RegistryDevice device;
+  ASSERT_TRUE(device.install("org.a", package("1")));
+  device.files->ownFiles().createDirectory("/state/uninstalled.plist/x", true, {}, nullptr);
+  EXPECT_FALSE(device.installer->KilnLookupUninstalled());
+  EXPECT_NE(device.installer->KilnClearUninstalled({"org.b"}), 0);
+  std::optional<Error> error;
+  EXPECT_FALSE(device.installer->uninstall("org.a", &error));
+  EXPECT_TRUE(error && device.registry->applicationIsInstalled("org.a"));
+  EXPECT_EQ(uninstalledStatus(*device.store).count(), 0U);
+  device.files->ownFiles().removeItem("/state/uninstalled.plist", nullptr);
+  device.store->save("uninstalled", "no dictionary", nullptr);
+  EXPECT_EQ(device.installer->KilnLookupUninstalled()->count(), 0U);
+
+  const PropertyList good = PropertyList::array({"org.a", "org.b"});
+  EXPECT_TRUE(checkUninstalledSeed(good, nullptr));
+  for (const auto& [list, said] : {std::pair(PropertyList::array({"org.a", "a/b"}), "its entry 1 is none"),
+                                   std::pair(PropertyList::array({true}), "its entry 0 is none"),
+                                   std::pair(PropertyList("org.a"), "must be an array")}) {
+    error.reset();
+    EXPECT_FALSE(checkUninstalledSeed(list, &error));
+    EXPECT_NE(error.value_or(Error("", 0)).text().find(said), std::string::npos) << error->text();
+  }
 }
 
 }  // namespace
