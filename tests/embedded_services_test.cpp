@@ -2,15 +2,18 @@
 #include <gtest/gtest.h>
 
 #include <cerrno>
+#include <fstream>
 #include <set>
 #include <string>
 #include <utility>
 #include <vector>
 
 #include "embedded/device.h"
+#include "embedded/device_service.h"
 #include "embedded/icons.h"
 #include "embedded/notifications.h"
 #include "embedded/settings.h"
+#include "embedded/waiting.h"
 #include "tests/support/registry_device.h"
 #include "tests/support/world.h"
 
@@ -89,6 +92,139 @@ TEST(StateStore, WhatIsDamagedAgainTakesThePlaceOfWhatWasBefore) {
   std::optional<Error> error;
   EXPECT_TRUE(repairStateRecords(*device.files, repairs, &error)) << "nothing to repair, nothing to write";
   device.disk.failingCall = 0;
+}
+
+// --- files ----------------------------------------------------------------------------------------------------------
+
+// Writes down which records of accounts are asked for: not every file system can hold them.
+class AccountDisk : public Disk {
+ public:
+  std::string recorded;
+  int fsetxattr(int /*file*/, const char* name, const void* value, std::size_t size) override {
+    recorded += std::string(name).substr(std::string(name).rfind('.') + 1) + "=" +
+                std::string(static_cast<const char*>(value), size) + " ";
+    errno = ENOTSUP;
+    return -1;
+  }
+};
+
+TEST(Files, DirectoriesAreMadeAsAskedAndAccountsNeverMakeItFail) {
+  const test::TemporaryDirectory directory;
+  AccountDisk disk;
+  EmbeddedFileManager files(directory.path().string(), disk);
+  ASSERT_TRUE(files.writeFile("/file", Bytes{1}, nullptr));
+  const FileAttributes accounts{.ownerAccountName = "mobile", .groupOwnerAccountName = "wheel"};
+  struct Case {
+    const char* path;
+    bool intermediate;
+    int code;  // 0: it is there afterwards
+    std::string recorded;
+  };
+  const std::string once = "owner=mobile group=wheel ";
+  const Case cases[] = {{"/a", false, 0, once},
+                        {"/a", false, EEXIST, ""},
+                        {"/a", true, 0, ""},
+                        {"/x/y", false, ENOENT, ""},
+                        {"/x/y/z", true, 0, once + once + once},
+                        {"/", false, EEXIST, ""},
+                        {"/", true, 0, ""},
+                        {"/file", true, ENOTDIR, ""},
+                        {"/file/b", true, ENOTDIR, ""},
+                        {"/file", false, ENOTDIR, ""}};
+  for (const Case& one : cases) {
+    SCOPED_TRACE(one.path);
+    disk.recorded.clear();
+    std::optional<Error> error;
+    EXPECT_EQ(files.createDirectory(one.path, one.intermediate, accounts, &error), one.code == 0);
+    EXPECT_EQ(error ? error->code() : 0, one.code) << (error ? error->description() : "");
+    EXPECT_EQ(files.isDirectory(one.path), one.code == 0 || one.code == EEXIST);
+    EXPECT_EQ(disk.recorded, one.recorded);
+  }
+  disk.recorded.clear();
+  EXPECT_TRUE(files.createDirectory("/b", false, {}, nullptr) && files.createFile("/f", Bytes{1}, accounts));
+  EXPECT_EQ(disk.recorded, once);
+  EXPECT_FALSE(files.attributesOfItem("/f", nullptr)->attributes.ownerAccountName);
+}
+
+TEST(Files, WhatIsTheRootOrADirectoryIsNoFile) {
+  const test::TemporaryDirectory directory;
+  Disk disk;
+  EmbeddedFileManager files(directory.path().string(), disk);
+  ASSERT_TRUE(files.createDirectory("/d/e", true, {}, nullptr) && files.writeFile("/f", Bytes{1}, nullptr));
+  using Operation = std::function<bool(ErrorOut)>;
+  const std::pair<const char*, Operation> refused[] = {
+      {"write the root", [&](auto error) { return files.writeFile("/", Bytes{2}, error); }},
+      {"write a directory", [&](auto error) { return files.writeFile("/d", Bytes{2}, error); }},
+      {"sink the root", [&](auto error) { return files.openSink("/", error) != nullptr; }},
+      {"sink a directory", [&](auto error) { return files.openSink("/d", error) != nullptr; }},
+      {"sink nowhere", [&](auto error) { return files.openSink("/none/x", error) != nullptr; }},
+      {"remove the root", [&](auto error) { return files.removeItem("/", error); }},
+      {"remove nothing", [&](auto error) { return files.removeItem("/none", error); }},
+      {"move the root", [&](auto error) { return files.moveItem("/", "/x", error); }},
+      {"move over a file", [&](auto error) { return files.moveItem("/d", "/f", error); }},
+      {"move into itself", [&](auto error) { return files.moveItem("/d", "/d/e/x", error); }},
+      {"copy a directory", [&](auto error) { return files.copyItem("/d", "/x", error); }},
+      {"copy over a directory", [&](auto error) { return files.copyItem("/f", "/d", error); }},
+      {"attributes of nothing", [&](auto error) { return files.attributesOfItem("/none", error).has_value(); }},
+      {"list a file", [&](auto error) { return files.contentsOfDirectory("/f", error).has_value(); }},
+      {"read a directory", [&](auto error) { return files.readFile("/d", error).has_value(); }}};
+  for (const auto& [title, operation] : refused) {
+    std::optional<Error> error;
+    EXPECT_FALSE(operation(&error)) << title;
+    ASSERT_TRUE(error) << title;
+    EXPECT_EQ(error->domain(), kFileErrorDomain) << title;
+    std::size_t count = 0;
+    for (const auto& entry : std::filesystem::recursive_directory_iterator(directory.path())) count += entry.exists();
+    EXPECT_EQ(count, 3U) << title << " left something behind";
+  }
+  {
+    std::optional<Error> error;
+    const auto sink = files.openSink("/f", &error);
+    ASSERT_TRUE(sink && sink->append("abc", 3, &error));
+    EXPECT_EQ(files.readFile("/f", nullptr), Bytes{1}) << "the old one stays until the new one is finished";
+  }
+  EXPECT_EQ(files.readFile("/f", nullptr), Bytes{1}) << "what is not finished is given up";
+  EXPECT_EQ(files.contentsOfDirectory("/", nullptr)->size(), 2U);
+}
+
+TEST(Files, OnlyNamesOfTheirOwnPatternAreTemporary) {
+  const std::pair<const char*, bool> cases[] = {
+      {".tmp-appsync-0123456789abcdef", true},  {".tmp-appsync-0123456789abcdeg", false},
+      {".tmp-appsync-0123456789abcde", false},  {".tmp-appsync-0123456789abcdef0", false},
+      {"xtmp-appsync-0123456789abcdef", false}, {".tmp-appsync-0123456789ABCDEF", false},
+      {"0123456789abcdef0123456789abc", false}, {"", false}};
+  const test::TemporaryDirectory directory;
+  Disk disk;
+  EmbeddedFileManager files(directory.path().string(), disk);
+  for (const auto& [name, isTemporary] : cases) EXPECT_EQ(isTemporaryName(name), isTemporary) << name;
+  ASSERT_TRUE(files.createDirectory("/d/.tmp-appsync-0123456789abcdef/inside", true, {}, nullptr));
+  EXPECT_EQ(files.removeLeftTemporaryFiles(), 0U) << "a directory is somebody's own";
+  std::ofstream(directory.path() / "d/.tmp-appsync-1123456789abcdef") << "left by a crash";
+  EXPECT_EQ(files.removeLeftTemporaryFiles(), 1U);
+}
+
+TEST(DeviceService, ANewQueueBeginsAnew) {
+  RegistryDevice device;
+  EmbeddedDeviceService service(*device.executor);
+  EmbeddedWaiting waiting;
+  const auto asset = [](const char* identifier) {
+    return DovelAsset::downloadAssetWithIdentifier(identifier, "Application", std::nullopt);
+  };
+  service.setQueue({"a", "b"});
+  EXPECT_EQ(service.takeNext()->identifier, "a");
+  service.cancelAssetTransferForFailedAsset(asset("a"));
+  service.prioritizeAsset(asset("b"), nullptr);
+  EXPECT_TRUE(service.waitUntilDropped("a", waiting, waiting.now()));
+  EXPECT_TRUE(service.waitUntilPrioritized("b", waiting, waiting.now()));
+  service.setQueue({"b"});
+  EXPECT_FALSE(service.waitUntilDropped("a", waiting, waiting.now()) || service.isDropped("a"));
+  EXPECT_FALSE(service.waitUntilPrioritized("b", waiting, waiting.now()));
+  service.cancelAssetTransferForFailedAsset(asset("a"));
+  EXPECT_FALSE(service.isDropped("a")) << "it was begun in the queue before";
+  std::optional<Error> answer;
+  service.prioritizeAsset(asset("a"), [&](const auto& error) { answer = error; });
+  device.executor->drain();
+  EXPECT_EQ(answer.value_or(Error("", 0)).code(), kTransferUnknown);
 }
 
 // --- settings -------------------------------------------------------------------------------------------------------
