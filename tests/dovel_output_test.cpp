@@ -225,7 +225,7 @@ TEST_F(OutputTest, EveryFormOfAValueInJSON) {
 }
 
 TEST_F(OutputTest, JSONMayNestAsDeepAsAReaderCanFollow) {
-  const auto nested = [](int depth) { return std::string(depth, '[') + std::string(depth, ']'); };
+  const auto nested = [](std::size_t depth) { return std::string(depth, '[') + std::string(depth, ']'); };
   const std::string shallow = R"({"lastSync": [)";
   std::string beside = R"(")" + std::string(600, '[') + R"(\"[", "\\")";
   for (int i = 0; i < 600; ++i) beside += R"(, "org.x")";

@@ -397,30 +397,28 @@ TEST(Icons, ABundleIsADirectoryAndItsInformationADictionary) {
     put(device, "/var/mobile/Media/a/Info.plist", content);
     EXPECT_EQ(icons.bundleWithURL(url)->infoDictionary, PropertyList::dictionary()) << content;
   }
-  // Beyond the first 64 pictures none is looked at, and no picture may be higher than 4096 pixels either.
-  Bytes small;
-  Bytes high;
-  for (const auto& [buffer, height] : {std::pair(&small, 1U), std::pair(&high, 4097U)}) {
-    const auto destination = icons.makePNGDestination(*buffer);
-    destination->addImage({.width = 1, .height = height, .pixels = Bytes(4ULL * height, 50)});
-    ASSERT_TRUE(destination->finalize());
-  }
-  PropertyList names = PropertyList::array();
-  for (int i = 0; i < 65; ++i) names.append(std::to_string(i));
-  const auto hasIcon = [&] {
-    return icons
-        .GlintCreateDeviceAppropriateHomeScreenIconImageFromBundle(
-            {url, PropertyList::dictionary({{"TefBundleIconFiles", names}})})
-        .has_value();
+  // Of more pictures than a bundle can have the first 64 are looked at, and none is higher than 4096 pixels.
+  const auto picture = [&](std::uint32_t width, std::uint32_t height, std::uint8_t red) {
+    Bytes buffer;
+    const auto destination = icons.makePNGDestination(buffer);
+    Image image{.width = width, .height = height, .pixels = Bytes(4ULL * width * height, 255)};
+    for (std::size_t at = 0; at < image.pixels.size(); at += 4) image.pixels[at] = red;
+    destination->addImage(image);
+    EXPECT_TRUE(destination->finalize());
+    return buffer;
   };
-  for (int i = 0; i < 64; ++i) put(device, "/var/mobile/Media/a/" + std::to_string(i), {high.begin(), high.end()});
-  put(device, "/var/mobile/Media/a/64", {small.begin(), small.end()});
-  EXPECT_TRUE(hasIcon()) << "what cannot be read is not counted";
-  put(device, "/var/mobile/Media/a/63", {small.begin(), small.end()});
-  EXPECT_TRUE(hasIcon());
-  device.files->createDirectory("/var/mobile/Media/b/64", true, {}, nullptr);
-  EXPECT_FALSE(icons.GlintCreateDeviceAppropriateHomeScreenIconImageFromBundle(
-      {*FileURL::fileURLWithPath("/var/mobile/Media/b", true), plist(R"({"TefBundleIconFiles": ["64", 5]})")}));
+  EXPECT_TRUE(decodePNG(picture(1, 4096, 1)));
+  EXPECT_FALSE(decodePNG(picture(1, 4097, 1)));
+  PropertyList names = PropertyList::array();
+  for (std::uint32_t i = 0; i < 66; ++i) {
+    const Bytes bytes = picture(i == 0 ? 4097 : i, 1, static_cast<std::uint8_t>(i));
+    put(device, "/var/mobile/Media/a/" + std::to_string(i), {bytes.begin(), bytes.end()});
+    names.append(std::to_string(i));
+  }
+  const auto icon = icons.GlintCreateDeviceAppropriateHomeScreenIconImageFromBundle(
+      {url, PropertyList::dictionary({{"TefBundleIconFiles", names}})});
+  ASSERT_TRUE(icon);
+  EXPECT_EQ(icon->pixels[(60 * 120 + 60) * 4], 64) << "what cannot be read is not counted";
 }
 
 // --- the registry ---------------------------------------------------------------------------------------------------
@@ -477,6 +475,9 @@ TEST(Registry, WhatIsReplacedOrRemovedIsGoneFromTheDiskAtOnce) {
   EXPECT_EQ(device.containers(), std::vector<std::string>{"99"});
   EXPECT_TRUE(device.registry->removeApplication("org.a", nullptr));
   EXPECT_TRUE(device.containers().empty());
+  seed(device, one, one);
+  EXPECT_TRUE(device.registry->removeApplication("org.a", nullptr));
+  EXPECT_TRUE(device.containers().empty()) << "the placeholder goes with its application";
 }
 
 // A removal whose record stays has not happened, whoever asks, and says so.
@@ -573,6 +574,29 @@ TEST(Registry, ACancellationNamesItsApplicationEvenWithoutAPlaceholder) {
   device.registry->installsDidCancel("org.gone");
   device.executor->drain();
   EXPECT_EQ(observer->heard, "org.gone=org.gone ");
+}
+
+// --- the whole device -----------------------------------------------------------------------------------------------
+
+TEST(Device, AnEmptyDiskBecomesADeviceAndWhatIsNoNameDoesNot) {
+  const test::TemporaryDirectory directory;
+  const auto open = [](const std::string& name, ErrorOut error) {
+    DeviceOptions options;
+    options.directory = name;
+    return Device::open(options, error) != nullptr;
+  };
+  for (const std::string& name : {std::string(), directory.path().string() + std::string("/x\0y", 4)}) {
+    std::optional<Error> error;
+    EXPECT_FALSE(open(name, &error));
+    EXPECT_EQ(std::exchange(error, std::nullopt).value_or(Error("", 0)).code(), kDeviceUnusable);
+    EXPECT_FALSE(Device::status(name, &error));
+    EXPECT_EQ(error.value_or(Error("", 0)).code(), kDeviceUnusable);
+  }
+  EXPECT_TRUE(std::filesystem::is_empty(directory.path()));
+  std::filesystem::create_directory(directory.path() / "lost+found");
+  EXPECT_FALSE(Device::status(directory.path().string(), nullptr)) << "no device yet";
+  EXPECT_TRUE(open(directory.path().string(), nullptr));
+  EXPECT_TRUE(Device::status(directory.path().string(), nullptr));
 }
 
 TEST(RegistrySeed, EveryFieldIsShownAsItWasSeeded) {
