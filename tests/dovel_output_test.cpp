@@ -41,7 +41,7 @@ TEST_F(OutputTest, StatusIsATableForAPersonAndADocumentForAProgram) {
   org.with.an.identifier.that.fits.into.no.column… -       B    User   500   var/mobile/Containers/3
 placeholders (1)
   identifier name installType version launchProhibited type
-  org.p      P    2           3       true             User
+  org.p      P    restore (2) 3       true             User
 coordinators (2)
   identifier kind       creator error         responsibleClient
   org.d      initiating 1       gone�for good -

@@ -56,6 +56,7 @@ class RestoreRunTest : public ProgramTest {
 TEST_F(RestoreRunTest, ABackupComesBackAndLaterSyncsLeaveItAloneUnlessAsked) {
   const std::string backup = sampleBackup();
   const auto before = treeOf(backup);
+  EXPECT_EQ(dovel({"settings", "--device", at("device")}).status, 0);
   write(at(kProcessedList), "an older one");
   const Outcome run = restore(backup, {"--json", "--log", at("log"), "--trace", at("trace")});
   EXPECT_EQ(run.status, 0) << run.err;

@@ -542,9 +542,10 @@ TEST(Installer, aListThatCannotBeReadIsNoEmptyList) {
 
   const PropertyList good = PropertyList::array({"org.a", "org.b"});
   EXPECT_TRUE(checkUninstalledSeed(good, nullptr));
-  for (const auto& [list, said] : {std::pair(PropertyList::array({"org.a", "a/b"}), "its entry 1 is none"),
-                                   std::pair(PropertyList::array({true}), "its entry 0 is none"),
-                                   std::pair(PropertyList("org.a"), "must be an array")}) {
+  for (const auto& [list, said] :
+       {std::pair(PropertyList::array({"org.a", "a/b"}), "entry 2 must be a bundle identifier"),
+        std::pair(PropertyList::array({true}), "entry 1 must be a bundle identifier"),
+        std::pair(PropertyList("org.a"), "must be an array")}) {
     error.reset();
     EXPECT_FALSE(checkUninstalledSeed(list, &error));
     EXPECT_NE(error.value_or(Error("", 0)).text().find(said), std::string::npos) << error->text();

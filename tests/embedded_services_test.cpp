@@ -72,6 +72,7 @@ TEST(StateStore, TellsWhatIsMissingFromWhatCannotBeRead) {
 }
 
 TEST(StateStore, WhatIsDamagedAgainTakesThePlaceOfWhatWasBefore) {
+  const auto isAnything = [](const std::string&, const PropertyList&) { return true; };
   RegistryDevice device;
   const auto own = device.files->ownFiles();
   for (const std::string content : {"first", "second"}) {
@@ -81,7 +82,7 @@ TEST(StateStore, WhatIsDamagedAgainTakesThePlaceOfWhatWasBefore) {
         EmbeddedFileManager(own).writeFile("/state/broken.plist", Bytes(content.begin(), content.end()), nullptr));
     EXPECT_FALSE(device.store->hasSetAside("."));
     std::vector<std::string> repairs;
-    ASSERT_TRUE(repairStateRecords(*device.files, repairs, nullptr)) << content;
+    ASSERT_TRUE(repairStateRecords(*device.files, isAnything, repairs, nullptr)) << content;
     EXPECT_EQ(repairs.size(), 1U);
     const auto aside = EmbeddedFileManager(own).readFile("/state/broken.plist.damaged", nullptr);
     EXPECT_EQ(std::string(aside->begin(), aside->end()), content);
@@ -90,7 +91,7 @@ TEST(StateStore, WhatIsDamagedAgainTakesThePlaceOfWhatWasBefore) {
   device.disk.forGood = true;
   std::vector<std::string> repairs;
   std::optional<Error> error;
-  EXPECT_TRUE(repairStateRecords(*device.files, repairs, &error)) << "nothing to repair, nothing to write";
+  EXPECT_TRUE(repairStateRecords(*device.files, isAnything, repairs, &error)) << "nothing to repair, nothing to write";
   device.disk.failingCall = 0;
 }
 
