@@ -4,6 +4,7 @@
 #include <mutex>
 #include <thread>
 
+#include "client/apps_client.h"
 #include "embedded/coordination.h"
 #include "embedded/device.h"
 #include "embedded/registry.h"
@@ -399,6 +400,61 @@ TEST_F(EmbeddedCoordinationTest, StrangeRecordsAreNeitherLostNorBelieved) {
   ASSERT_EQ(bare.device->repairs().size(), 1U);
   EXPECT_NE(bare.device->repairs()[0].find("org.kindless.plist.damaged"), std::string::npos);
   EXPECT_TRUE(std::filesystem::exists(bare.directory + "/state/coordinators/org.kindless.plist.damaged"));
+}
+
+// Power is lost at each change of the disk in turn while the applications of a backup come back, one of them demoted. No
+// placeholder is left without a coordinator that answers for it, and restoring once more ends with all of them.
+TEST_F(EmbeddedCoordinationTest, ARestoreThatWasCutShortIsDoneByTheNext) {
+  const auto bytes = [](const PropertyList& value) {
+    return *serializePropertyList(value, PropertyListFormat::Binary, nullptr);
+  };
+  const PropertyList entry =
+      PropertyList::dictionary({{"TarvoMetadata", PropertyList::data(bytes(PropertyList::dictionary()))},
+                                {"PlaceholderIcon", PropertyList::data(Bytes{1, 2})}});
+  const auto restore = [&](BareDevice& device) {
+    device.device->waiting().runFast(*device.executor);
+    AppsClient client(device.platform());
+    return client._processTarvoRestoreInfo();
+  };
+  const auto putBackup = [&](BareDevice& device) {
+    FileManager& files = *device.platform().files;
+    files.writeFile("/var/mobile/Media/TarvoRestore/RestoreApplications.plist",
+                    bytes(PropertyList::dictionary({{"org.a", entry}, {"org.b", entry}})), nullptr);
+    files.writeFile("/var/mobile/Library/Preferences/com.zelk.Vaultry.DemotedApps.plist",
+                    bytes(PropertyList::dictionary({{"AutomaticDowngrades", PropertyList::array({"org.b"})}})),
+                    nullptr);
+  };
+  bool cutShort = true;
+  for (int at = 1; cutShort; ++at) {
+    SCOPED_TRACE("change " + std::to_string(at));
+    BareDevice device(static_cast<std::uint64_t>(at));
+    putBackup(device);
+    device.start(at);
+    if (device.device) restore(device);
+    if (device.device) device.settle();
+    cutShort = device.disk.failingCall == 1;
+
+    device.start();
+    ASSERT_TRUE(device.device && device.device->repairs().empty());
+    device.settle();
+    ContractClient next(device.platform());
+    for (const char* id : {"org.a", "org.b"}) {
+      const auto found = next.coordinator(Kind::Any, id, false);
+      EXPECT_EQ(next.hasPlaceholder(id), found && !found.error()) << id;
+    }
+    putBackup(device);
+    EXPECT_TRUE(restore(device));
+    device.settle();
+    for (const auto& [id, type] :
+         {std::pair("org.a", kPellumInstallTypeRestore), std::pair("org.b", kPellumInstallTypeDowngrade)}) {
+      const auto shown = next.registry().applicationProxyForIdentifier(id, true);
+      ASSERT_TRUE(shown) << id;
+      EXPECT_EQ(shown->installType, type) << id;
+      EXPECT_EQ(next.files().readFile(shown->bundleURL->path() + "/Icon.png", nullptr), (Bytes{1, 2})) << id;
+    }
+    EXPECT_EQ(device.coordinators().count(), 2U);
+    ASSERT_LT(at, 500);
+  }
 }
 
 }  // namespace
