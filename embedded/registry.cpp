@@ -305,7 +305,7 @@ std::uint64_t EmbeddedRegistry::arrivalOf(const std::string& bundleID) {
 
 std::string EmbeddedRegistry::newContainerName() {
   while (true) {
-    const std::string name = std::to_string(_nextSerial.fetch_add(1));
+    std::string name = std::to_string(_nextSerial.fetch_add(1));
     const bool isTaken = _files.fileExists(std::string(kContainersDirectory).append("/").append(name)) ||
                          _files.fileExists(std::string(kPlaceholdersDirectory).append("/").append(name));
     if (!isTaken) return name;
