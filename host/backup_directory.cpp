@@ -4,7 +4,6 @@
 #include <sys/stat.h>
 
 #include <cerrno>
-#include <cstring>
 
 namespace appsync {
 
@@ -16,6 +15,8 @@ struct List {
   const char* directory;
 };
 
+constexpr SourceKind kBackup{"backup directory", kBackupRestoreList};
+
 constexpr List kLists[] = {
     {kBackupRestoreList, "/var/mobile/Media/TarvoRestore"},
     {kBackupDemotedApps, "/var/mobile/Library/Preferences"},
@@ -23,12 +24,11 @@ constexpr List kLists[] = {
 
 }  // namespace
 
-std::optional<BackupDirectory> BackupDirectory::open(const std::string& path, Failure& failure) {
-  OwnedFile directory(::open(path.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
-  if (directory) return BackupDirectory(path, std::make_shared<OwnedFile>(std::move(directory)));
-  failure = {FailureCode::HostUnusable, "the backup directory \"" + path + "\" cannot be used: " + std::strerror(errno),
-             "name a directory that holds " + std::string(kBackupRestoreList)};
-  return std::nullopt;
+std::optional<BackupDirectory> BackupDirectory::open(const std::string& path, const std::string& device,
+                                                     Failure& failure) {
+  OwnedFile directory = openSource(kBackup, path, device, failure);
+  if (!directory) return std::nullopt;
+  return BackupDirectory(path, std::make_shared<OwnedFile>(std::move(directory)));
 }
 
 bool BackupDirectory::push(EmbeddedFileManager& files, const CopySupervision& supervision, Failure& failure) const {
@@ -39,7 +39,7 @@ bool BackupDirectory::push(EmbeddedFileManager& files, const CopySupervision& su
     bool done = files.createDirectory(list.directory, true, {}, &error);
     if (done && files.fileExists(target)) done = files.removeItem(target, &error);
     if (!done) {
-      failure = {FailureCode::DeviceUnusable, error->text(), "make the device's directory writable"};
+      failure = failureFrom(FailureCode::DeviceUnusable, *error, "make the device's directory writable");
       return false;
     }
     struct stat information {};

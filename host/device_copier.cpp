@@ -4,8 +4,11 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <cerrno>
 #include <cstring>
+#include <filesystem>
+#include <utility>
 
 namespace appsync {
 
@@ -13,7 +16,57 @@ namespace {
 
 constexpr std::size_t kDeepest = 32;  // directories within directories
 
+using Identity = std::pair<dev_t, ino_t>;
+
+// The directory itself and those above it, as far up as they can be told.
+std::vector<Identity> lineOf(int directory) {
+  std::vector<Identity> line;
+  OwnedFile above;
+  struct stat information {};
+  while (::fstat(directory, &information) == 0) {
+    const Identity identity(information.st_dev, information.st_ino);
+    if (!line.empty() && line.back() == identity) break;  // the root
+    line.push_back(identity);
+    above = OwnedFile(::openat(directory, "..", O_PATH | O_DIRECTORY | O_CLOEXEC));
+    directory = above.get();
+  }
+  return line;
+}
+
+// Why the device cannot take anything from a directory; empty when it can.
+std::string whyTooClose(int source, const std::string& device) {
+  const std::vector<Identity> sourceLine = lineOf(source);
+  std::filesystem::path path = device;
+  OwnedFile nearest;  // the device's directory, or the first one above it that is there
+  bool isThere = true;
+  while (!(nearest = OwnedFile(::open(path.empty() ? "." : path.c_str(), O_PATH | O_DIRECTORY | O_CLOEXEC)))) {
+    if (errno != ENOENT || path.empty() || path == path.parent_path()) return "";
+    path = path.parent_path();
+    isThere = false;
+  }
+  const std::vector<Identity> deviceLine = lineOf(nearest.get());
+  const auto liesIn = [](const std::vector<Identity>& line, const std::vector<Identity>& other) {
+    return !other.empty() && std::find(line.begin(), line.end(), other.front()) != line.end();
+  };
+  if (isThere && liesIn(sourceLine, deviceLine)) return "it lies in the device \"" + device + "\"";
+  if (liesIn(deviceLine, sourceLine)) return "the device \"" + device + "\" lies in it";
+  return "";
+}
+
 }  // namespace
+
+OwnedFile openSource(const SourceKind& kind, const std::string& path, const std::string& device, Failure& failure) {
+  OwnedFile directory(::open(path.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
+  const auto refuse = [&](const std::string& why, const std::string& hint) {
+    failure = {FailureCode::HostUnusable, "the " + std::string(kind.name) + " \"" + path + "\" cannot be used: " + why,
+               hint};
+    return OwnedFile();
+  };
+  if (!directory) return refuse(std::strerror(errno), "name a directory that holds " + std::string(kind.content));
+  const std::string tooClose = whyTooClose(directory.get(), device);
+  if (!tooClose.empty()) return refuse(tooClose, "keep it and the device in directories apart from each other");
+  return directory;
+}
 
 OwnedFile openPlainFile(int directory, const std::string& name, struct stat& information) {
   OwnedFile file(::openat(directory, name.c_str(), O_RDONLY | O_NOFOLLOW | O_CLOEXEC | O_NONBLOCK));
@@ -100,7 +153,7 @@ bool DeviceCopier::sourceFailed(const std::string& name, int errorNumber) {
 }
 
 bool DeviceCopier::deviceFailed(const Error& error) {
-  _failure = {FailureCode::DeviceUnusable, error.text(), "make room on the device's disk, and make it writable"};
+  _failure = failureFrom(FailureCode::DeviceUnusable, error, "make room on the device's disk, and make it writable");
   return false;
 }
 

@@ -49,6 +49,16 @@ class DeviceCopier {
   std::vector<char> _piece;
 };
 
+// What messages say of a directory to copy from.
+struct SourceKind {
+  const char* name;
+  const char* content;  // what it has to hold
+};
+
+// Opens a directory to copy from. None, with the failure said, when it cannot be opened, and when it lies in the
+// device's directory or that in it: clearing the device would clear what is to be copied.
+OwnedFile openSource(const SourceKind& kind, const std::string& path, const std::string& device, Failure& failure);
+
 // A plain file below a directory. None, with errno, for everything else.
 OwnedFile openPlainFile(int directory, const std::string& name, struct stat& information);
 

@@ -18,15 +18,20 @@ namespace {
 constexpr char kIncoming[] = "/var/mobile/Media/PublicStaging/.ApplicationSync.incoming";
 constexpr char kLastSyncDirectory[] = "/var/mobile/Library/ApplicationSync";
 constexpr char kLastSyncList[] = "LastSyncAppState.plist";
+constexpr SourceKind kHost{"host directory", "ApplicationSync and Packages"};
+
+// Whether this error of opening a package tells that there is no such plain file, and no name that could have one.
+bool tellsOfNoFile(int error) {
+  return error == ENOENT || error == ENOTDIR || error == EISDIR || error == EINVAL || error == ELOOP ||
+         error == ENXIO || error == ENAMETOOLONG;
+}
 
 }  // namespace
 
-std::optional<HostDirectory> HostDirectory::open(const std::string& path, Failure& failure) {
-  OwnedFile directory(::open(path.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
-  if (directory) return HostDirectory(path, std::make_shared<OwnedFile>(std::move(directory)));
-  failure = {FailureCode::HostUnusable, "the host directory \"" + path + "\" cannot be used: " + std::strerror(errno),
-             "name a directory that holds ApplicationSync and Packages"};
-  return std::nullopt;
+std::optional<HostDirectory> HostDirectory::open(const std::string& path, const std::string& device, Failure& failure) {
+  OwnedFile directory = openSource(kHost, path, device, failure);
+  if (!directory) return std::nullopt;
+  return HostDirectory(path, std::make_shared<OwnedFile>(std::move(directory)));
 }
 
 bool HostDirectory::push(EmbeddedFileManager& files, const CopySupervision& supervision, Failure& failure) const {
@@ -46,7 +51,7 @@ bool HostDirectory::push(EmbeddedFileManager& files, const CopySupervision& supe
     const OwnedFile source = openDirectoryAt(disk, _directory->get(), "ApplicationSync");
     bool done = copier.copyDirectory(source, "ApplicationSync", kIncoming);
     if (done && !files.moveItem(kIncoming, kStagedSync, &error)) {
-      failure = {FailureCode::DeviceUnusable, error->text(), "make the device's directory writable"};
+      failure = failureFrom(FailureCode::DeviceUnusable, *error, "make the device's directory writable");
       done = false;
     }
     if (!done) {
@@ -56,27 +61,34 @@ bool HostDirectory::push(EmbeddedFileManager& files, const CopySupervision& supe
   }
   if (!has(kLastSyncList, S_IFREG)) return true;
   if (!files.createDirectory(kLastSyncDirectory, true, {}, &error)) {
-    failure = {FailureCode::DeviceUnusable, error->text(), "make the device's directory writable"};
+    failure = failureFrom(FailureCode::DeviceUnusable, *error, "make the device's directory writable");
     return false;
   }
   return copier.copyFile(_directory->get(), kLastSyncList, std::string(kLastSyncDirectory) + "/" + kLastSyncList);
 }
 
 OwnedFile HostDirectory::openPackage(const std::string& identifier, std::uint64_t& size, ErrorOut error) const {
-  Disk disk;
-  struct stat information {};
   const std::string name = identifier + ".ipa";
-  OwnedFile package;
+  int reason = ENOENT;
   if (isSinglePathComponent(identifier)) {
+    Disk disk;
+    struct stat information {};
     const OwnedFile packages = openDirectoryAt(disk, _directory->get(), "Packages");
-    if (packages) package = openPlainFile(packages.get(), name, information);
+    OwnedFile package = packages ? openPlainFile(packages.get(), name, information) : OwnedFile();
+    if (package) {
+      size = static_cast<std::uint64_t>(information.st_size);
+      return package;
+    }
+    reason = errno;
   }
-  if (package) {
-    size = static_cast<std::uint64_t>(information.st_size);
-    return package;
+  const std::string domain(kTransferErrorDomain);
+  if (tellsOfNoFile(reason)) {
+    setError(error,
+             Error(domain, kTransferMissing, "missing package: the host has no plain file \"Packages/" + name + "\""));
+  } else {
+    setError(error, Error(domain, kTransferBroken,
+                          "the host's \"Packages/" + name + "\" cannot be read: " + std::strerror(reason)));
   }
-  setError(error, Error(std::string(kTransferErrorDomain), kTransferMissing,
-                        "missing package: the host has no plain file \"Packages/" + name + "\" that can be read"));
   return {};
 }
 

@@ -20,15 +20,17 @@ inline constexpr char kPackageDirectory[] = "/var/mobile/Media/PublicStaging/Pac
 
 class HostDirectory {
  public:
-  // None, with the failure said, when there is no such directory.
-  static std::optional<HostDirectory> open(const std::string& path, Failure& failure);
+  // None, with the failure said, when there is no such directory, or when it and that of the device lie one in the
+  // other.
+  static std::optional<HostDirectory> open(const std::string& path, const std::string& device, Failure& failure);
 
   // Puts a copy of "ApplicationSync" into the staging area, in one step once it is whole, and the last-sync list to its
   // place. What the host does not have is left out. False, with the failure said, when something cannot be read or
   // written (then nothing is staged), or when it was stopped (then the failure stays untouched).
   bool push(EmbeddedFileManager& files, const CopySupervision& supervision, Failure& failure) const;
 
-  // A package, open for reading. None, with an error of the domain "TransferError", when the host does not have it.
+  // A package, open for reading. None, with an error of the domain "TransferError": the host does not have it, or it
+  // cannot be read.
   OwnedFile openPackage(const std::string& identifier, std::uint64_t& size, ErrorOut error) const;
 
  private:

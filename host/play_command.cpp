@@ -67,8 +67,12 @@ Json arrayOf(const auto& values) {
 
 class PlayRun {
  public:
-  PlayRun(const PlayScript& script, Session& session, Console& console)
-      : _script(script), _session(session), _console(console), _workspace(*session.platform().defaultWorkspace) {}
+  PlayRun(const PlayScript& script, std::string device, Session& session, Console& console)
+      : _script(script),
+        _device(std::move(device)),
+        _session(session),
+        _console(console),
+        _workspace(*session.platform().defaultWorkspace) {}
   ~PlayRun() {
     Failure ignored;
     _session.close(ignored);  // nobody may use the workspace any more
@@ -235,7 +239,7 @@ class PlayRun {
   }
 
   bool stage(const std::string& name, Failure& failure) {
-    const auto host = HostDirectory::open(besideScript(name), failure);
+    const auto host = HostDirectory::open(besideScript(name), _device, failure);
     if (!host) return false;
     EmbeddedFileManager& files = _session.device().files();
     clearStaging(files, _session.device().coordination().packagePathsInUse());
@@ -256,6 +260,7 @@ class PlayRun {
   }
 
   const PlayScript& _script;
+  const std::string _device;  // its directory
   Session& _session;
   Console& _console;
   ObservedWorkspace _workspace;
@@ -273,7 +278,7 @@ int runPlay(const PlayOptions& options, Console& console) {
       {.common = options.common, .mainBundleIdentifier = script->mainBundleIdentifier, .wrapsServices = true}, failure);
   if (!session) return console.fail(failure);
 
-  PlayRun run(*script, *session, console);
+  PlayRun run(*script, options.common.device, *session, console);
   if (!run.run(failure)) return console.fail(failure);
   const bool wasInterrupted = session->interrupt().signal() != 0;
   const int status = wasInterrupted     ? session->interrupt().exitStatus()

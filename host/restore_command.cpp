@@ -152,7 +152,7 @@ void printSummary(const RestoreReport& report, Console& console) {
 
 int runRestore(const RestoreOptions& options, Console& console) {
   Failure failure;
-  const std::optional<BackupDirectory> backup = BackupDirectory::open(options.backup, failure);
+  const std::optional<BackupDirectory> backup = BackupDirectory::open(options.backup, options.common.device, failure);
   if (!backup) return console.fail(failure);
   RestoreProgress progress(console, canDrawInPlace(options.common, console));
   const auto session = Session::open(

@@ -270,7 +270,7 @@ class SyncRun {
 int runSync(const SyncOptions& options, Console& console) {
   Failure failure;
   SyncLog log;
-  const std::optional<HostDirectory> host = HostDirectory::open(options.host, failure);
+  const std::optional<HostDirectory> host = HostDirectory::open(options.host, options.common.device, failure);
   if (!host) return console.fail(failure);
   const auto session = Session::open({.common = options.common, .listeners = {&log}}, failure);
   if (!session) return console.fail(failure);
