@@ -25,16 +25,28 @@ struct Everything {
   SampleOptions sample;
 };
 
-// CLI11 reads "-1" as a large unsigned number.
-std::string isWholeNumber(const std::string& text) {
-  const bool isOne =
-      !text.empty() && std::all_of(text.begin(), text.end(), [](char c) { return c >= '0' && c <= '9'; });
-  return isOne ? "" : "\"" + text + "\" is no whole number";
+bool areDigits(std::string_view text) {
+  return !text.empty() && std::all_of(text.begin(), text.end(), [](char c) { return c >= '0' && c <= '9'; });
 }
 
-std::string isInteger(const std::string& text) {
-  const bool isOne = isWholeNumber(text.starts_with('-') ? text.substr(1) : text).empty();
-  return isOne ? "" : "\"" + text + "\" is no integer";
+// CLI11 reads "-1" as a large unsigned number, and "010" as an octal one: these check a number, and take the zeros off
+// its front.
+std::string wholeNumber(std::string& text) {
+  if (!areDigits(text)) return "\"" + text + "\" is no whole number";
+  text.erase(0, std::min(text.find_first_not_of('0'), text.size() - 1));
+  return "";
+}
+
+std::string integer(std::string& text) {
+  const bool isNegative = text.starts_with('-');
+  std::string digits = text.substr(isNegative ? 1 : 0);
+  if (!wholeNumber(digits).empty()) return "\"" + text + "\" is no integer";
+  text = (isNegative ? "-" : "") + digits;
+  return "";
+}
+
+std::string isNamed(const std::string& text) {
+  return text.empty() ? "an empty text names nothing" : "";
 }
 
 class Grammar {
@@ -98,7 +110,7 @@ class Grammar {
     command.add_flag("--quiet", common.quiet, "Print nothing unless something failed");
     command.add_option("--log", common.log, "Write the log to FILE (- is standard error)")->type_name("FILE");
     command.add_option("--trace", common.trace, "Write a trace of installs and transfers to FILE")->type_name("FILE");
-    command.add_option("--plugin", common.plugin, "Load this plug-in")->type_name("FILE");
+    command.add_option("--plugin", common.plugin, "Load this plug-in")->check(isNamed)->type_name("FILE");
     repeatable(command.add_option("--fault", common.faults, "Make an operation fail: NAME[=ID][@N]"))
         ->type_name("SPEC");
   }
@@ -112,11 +124,13 @@ class Grammar {
         "sync", "Sync a host directory to the device", [&sync](Console& console) { return runSync(sync, console); },
         &sync.common);
     command->add_option("HOST", sync.host, "The host directory")->required();
-    command->add_option("--type", sync.type, "The type of the sync")->check(isWholeNumber)->type_name("N");
+    command->add_option("--type", sync.type, "The type of the sync")
+        ->transform(CLI::Validator(wholeNumber, ""))
+        ->type_name("N");
     command->add_flag("--fail-phase", sync.failPhase, "End the transfer phase without success");
     command->add_flag("--report-installs", sync.reportInstalls, "Report each install's result to the client");
     command->add_option("--rate", sync.rate, "Bytes per second; 0 is as fast as possible")
-        ->check(isWholeNumber)
+        ->transform(CLI::Validator(wholeNumber, ""))
         ->type_name("N");
     repeatable(command->add_option("--cancel", sync.cancel, "Cancel this install while its package is half way"))
         ->type_name("ID");
@@ -130,7 +144,7 @@ class Grammar {
         [&restore](Console& console) { return runRestore(restore, console); }, &restore.common);
     command->add_option("BACKUP", restore.backup, "The backup directory")->required();
     command->add_option("--type", restore.type, "The type of the restore (default 2)")
-        ->check(isInteger)
+        ->transform(CLI::Validator(integer, ""))
         ->type_name("N");
     command
         ->add_option("--host-process", restore.hostProcess,
@@ -178,14 +192,14 @@ class Grammar {
     SampleOptions& sample = _parsed.sample;
     CLI::App* command = add("sample", "Write a host directory, or a backup, with sample applications",
                             [&sample](Console& console) { return runSample(sample, console); });
-    command->add_option("DIR", sample.directory, "The directory to write; new, or empty")->required();
+    command->add_option("DIR", sample.directory, "The directory to write; new, or empty")->required()->check(isNamed);
     command->add_flag("--backup", sample.backup, "Write a backup directory, for dovel restore");
     command->add_option("--apps", sample.applications, "How many applications (default 8)")
-        ->check(isWholeNumber)
+        ->transform(CLI::Validator(wholeNumber, ""))
         ->check(CLI::Range(0, 10000))
         ->type_name("N");
     command->add_option("--seed", sample.seed, "The same seed gives the same bytes (default 1)")
-        ->check(isWholeNumber)
+        ->transform(CLI::Validator(wholeNumber, ""))
         ->type_name("S");
   }
 

@@ -24,6 +24,10 @@ constexpr std::array kKinds{
     FailureKind{FailureCode::Internal, "internal", kStatusUnusable},
 };
 
+std::string ownText(const Error& error) {
+  return error.text().empty() ? error.domain() + " " + std::to_string(error.code()) : error.text();
+}
+
 }  // namespace
 
 std::span<const FailureKind> failureKinds() {
@@ -38,17 +42,21 @@ const FailureKind& failureKind(FailureCode code) {
 }
 
 Failure failureFrom(FailureCode code, const Error& error, const std::string& otherHint) {
-  const std::string text = reasonText(error);
-  const std::size_t at = text.rfind("; ");
-  if (at == std::string::npos) return {code, text, otherHint};
-  return {code, text.substr(0, at), text.substr(at + 2)};
+  Failure failure{code, "", ""};
+  for (std::optional<Error> one = error; one; one = one->underlyingError()) {
+    const std::string text = ownText(*one);
+    const std::size_t end = text.rfind("; ");
+    failure.message += (failure.message.empty() ? "" : ": ") + text.substr(0, end);
+    if (end != std::string::npos && failure.hint.empty()) failure.hint = text.substr(end + 2);
+  }
+  if (failure.hint.empty()) failure.hint = otherHint;
+  return failure;
 }
 
 std::string reasonText(const Error& error) {
   std::string text;
   for (std::optional<Error> one = error; one; one = one->underlyingError()) {
-    if (!text.empty()) text += ": ";
-    text += one->text().empty() ? one->domain() + " " + std::to_string(one->code()) : one->text();
+    text += (text.empty() ? "" : ": ") + ownText(*one);
   }
   return text;
 }

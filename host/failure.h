@@ -50,8 +50,8 @@ struct Failure {
   std::string hint;     // what would mend it
 };
 
-// The failure that an error stands for. What the error's text says after its last "; " is the hint, if it says anything
-// there.
+// The failure that an error stands for. What a text says after its last "; " is what would mend it; of an error and
+// those that caused it the first that says so gives the hint.
 Failure failureFrom(FailureCode code, const Error& error, const std::string& otherHint);
 
 // Why something failed, for a person: the error's text and those of the errors that caused it.

@@ -24,7 +24,8 @@ std::string pathOfThisProgram() {
 }
 
 std::string pathOfPlugin(const std::optional<std::string>& file) {
-  if (file) return std::filesystem::absolute(*file).string();  // a bare name is a file here, not one of the system's
+  // A bare name is a file here, not one of the system's.
+  if (file) return file->find('/') == std::string::npos ? "./" + *file : *file;
   std::string beside = pathOfThisProgram() + "/AppSync.so";
   if (::access(beside.c_str(), F_OK) == 0) return beside;
   const std::string installed = pathOfThisProgram() + "/../lib/appsync/AppSync.so";

@@ -1,9 +1,12 @@
 // `dovel sample`: write a host directory, or a backup, with sample applications, the same bytes for the same seed.
+#include <fcntl.h>
+
 #include <algorithm>
 #include <array>
+#include <cerrno>
 #include <cstdint>
+#include <cstring>
 #include <filesystem>
-#include <fstream>
 #include <vector>
 
 #include "embedded/disk.h"
@@ -85,6 +88,11 @@ std::vector<SampleApplication> makeApplications(std::uint32_t count, std::uint64
   return applications;
 }
 
+Failure unwritable(const std::string& place, const std::string& why) {
+  return {FailureCode::OutputUnwritable, "\"" + place + "\" cannot be written: " + why,
+          "name a new directory in a place with room that can be written"};
+}
+
 // Writes the files; the first that fails ends it.
 class SampleWriter {
  public:
@@ -129,7 +137,7 @@ class SampleWriter {
                PropertyListFormat::Binary);
   }
 
-  const std::string& failedPath() const { return _failedPath; }
+  const Failure& failure() const { return _failure; }
 
  private:
   bool writeApplication(const SampleApplication& application) {
@@ -244,13 +252,16 @@ class SampleWriter {
 
   bool writeFile(const std::string& path, const std::string& bytes) {
     const fs::path place = _root / path;
-    std::error_code ignored;
-    fs::create_directories(place.parent_path(), ignored);
-    std::ofstream file(place, std::ios::binary | std::ios::trunc);
-    file.write(bytes.data(), static_cast<std::streamsize>(bytes.size()));
-    file.close();
-    if (!file.fail()) return true;
-    _failedPath = place.string();
+    std::error_code error;
+    fs::create_directories(place.parent_path(), error);
+    if (error) return isUnwritable(place.parent_path(), error.value());
+    const OwnedFile file(::open(place.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, 0666));
+    const int result = file ? writeAll(file.get(), bytes) : errno;
+    return result == 0 || isUnwritable(place, result);
+  }
+
+  bool isUnwritable(const fs::path& place, int error) {
+    _failure = unwritable(place.string(), std::strerror(error));
     return false;
   }
 
@@ -258,7 +269,7 @@ class SampleWriter {
   Disk _disk;
   EmbeddedFileManager _files;
   EmbeddedIconServices _icons;
-  std::string _failedPath;
+  Failure _failure{FailureCode::Internal, "a sample application could not be made", "please report it"};
 };
 
 }  // namespace
@@ -266,23 +277,19 @@ class SampleWriter {
 int runSample(const SampleOptions& options, Console& console) {
   std::error_code error;
   const fs::path root = options.directory;
-  if (fs::exists(root, error) && (!fs::is_directory(root, error) || !fs::is_empty(root, error) || error)) {
-    return console.fail({FailureCode::OutputUnwritable, "\"" + options.directory + "\" is there already and not empty",
-                         "name a new directory"});
+  if (fs::exists(root, error) && !fs::is_empty(root, error) && !error) {
+    const bool isDirectory = fs::is_directory(root, error);
+    return console.fail(
+        unwritable(options.directory, isDirectory ? "it is there already and not empty" : "it is no directory"));
   }
-  if (options.backup) {
-    fs::create_directories(root, error);
-  } else {
-    fs::create_directories(root / "ApplicationSync", error);
-    fs::create_directories(root / "Packages", error);
-  }
+  if (!error) fs::create_directories(root, error);
+  if (!error && !options.backup) fs::create_directories(root / "ApplicationSync", error);
+  if (!error && !options.backup) fs::create_directories(root / "Packages", error);
+  if (error) return console.fail(unwritable(options.directory, error.message()));
   SampleWriter writer(root);
   const std::vector<SampleApplication> applications = makeApplications(options.applications, options.seed);
-  if (error || !(options.backup ? writer.writeBackup(applications) : writer.write(applications))) {
-    const std::string where = writer.failedPath().empty() ? options.directory : writer.failedPath();
-    return console.fail({FailureCode::OutputUnwritable, "\"" + where + "\" cannot be written",
-                         "name a directory in a place with room that can be written"});
-  }
+  const bool isWritten = options.backup ? writer.writeBackup(applications) : writer.write(applications);
+  if (!isWritten) return console.fail(writer.failure());
   console.line("Wrote " + options.directory + " with " + counted(options.applications, "application", "applications") +
                ".");
   return kStatusDone;
