@@ -37,6 +37,9 @@ inline constexpr std::int64_t kDeviceUnusable = 2;  // cannot be made, read or w
 inline constexpr std::int64_t kDeviceMissing = 3;   // only where it must not be made: nothing is there
 inline constexpr std::int64_t kDeviceBadSeed = 4;   // what is to be put on it is not in order
 
+// Where the client keeps the todo list of the last sync.
+inline constexpr char kTodoList[] = "/var/mobile/Library/ApplicationSync/TarvoStuff/ApplicationsSync.plist";
+
 struct DeviceOptions {
   std::string directory;                                // made with everything a device has when it is not there
   std::string mainBundleIdentifier = "com.zelk.dovel";  // of the process that hosts the client

@@ -18,7 +18,6 @@ namespace appsync {
 
 namespace {
 
-constexpr char kTodoList[] = "/var/mobile/Library/ApplicationSync/TarvoStuff/ApplicationsSync.plist";
 constexpr char kRestoreState[] = "/var/mobile/Library/ApplicationSync/RestoreState.plist";
 constexpr char kLastSyncList[] = "/var/mobile/Library/ApplicationSync/LastSyncAppState.plist";
 

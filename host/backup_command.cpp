@@ -96,7 +96,7 @@ int runBackup(const BackupOptions& options, Console& console) {
   console.document({{"ok", untidy.empty()},
                     {"zelkIDs", ids},
                     {"accounts", accounts},
-                    {"disabledAssetTypes", disabled ? Json(*disabled) : Json(nullptr)},
+                    {"disabledAssetTypes", orNull(disabled)},
                     {"cleared", cleared}});
   printAccounts(accounts, console);
   printTexts("account ids", ids, console);

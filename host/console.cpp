@@ -7,6 +7,7 @@
 #include <cerrno>
 #include <cstring>
 
+#include "embedded/disk.h"
 #include "host/json.h"
 #include "host/text.h"
 
@@ -68,15 +69,8 @@ std::optional<Failure> Console::outputFailure() const {
 }
 
 int writeAll(int file, std::string_view bytes) {
-  while (!bytes.empty()) {
-    const ssize_t written = ::write(file, bytes.data(), bytes.size());
-    if (written < 0) {
-      if (errno == EINTR) continue;
-      return errno;
-    }
-    bytes.remove_prefix(static_cast<std::size_t>(written));
-  }
-  return 0;
+  Disk disk;
+  return writeAll(disk, file, bytes.data(), bytes.size()) ? 0 : errno;
 }
 
 }  // namespace appsync

@@ -1,6 +1,7 @@
 // Standard output and standard error of the program.
 #pragma once
 
+#include <atomic>
 #include <optional>
 #include <string>
 #include <string_view>
@@ -10,7 +11,8 @@
 
 namespace appsync {
 
-// Any thread may write; a line is one write. A reader that has gone away is no reason to stop.
+// Any thread may write. A line goes out in one write, unless the system takes it in parts: then another thread's line
+// may come between. A reader that has gone away is no reason to stop.
 class Console {
  public:
   Console(bool json, bool quiet) : _json(json), _quiet(quiet) {}
@@ -43,7 +45,7 @@ class Console {
  private:
   const bool _json;
   const bool _quiet;
-  int _outputError = 0;
+  std::atomic<int> _outputError = 0;
 };
 
 // Writes all bytes; 0 or the system's error number.

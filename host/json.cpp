@@ -300,9 +300,9 @@ Json accountDocuments(std::vector<DovelMutableAccountInfo> accounts) {
   std::sort(accounts.begin(), accounts.end(), [](const auto& a, const auto& b) { return a.zelkID() < b.zelkID(); });
   Json documents = Json::array();
   for (const DovelMutableAccountInfo& account : accounts) {
-    documents.push_back({{"zelkID", account.zelkID() ? Json(*account.zelkID()) : Json(nullptr)},
+    documents.push_back({{"zelkID", orNull(account.zelkID())},
                          {"qenID", account.qenID() ? jsonFromPropertyList(*account.qenID()) : Json(nullptr)},
-                         {"altQenID", account.altQenID() ? Json(*account.altQenID()) : Json(nullptr)}});
+                         {"altQenID", orNull(account.altQenID())}});
   }
   return documents;
 }

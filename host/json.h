@@ -27,7 +27,7 @@ std::string jsonText(const Json& value);
 // One line, for logs and traces.
 std::string jsonLine(const Json& value);
 
-// None, with an error that names line and column, when the text is no JSON or nests deeper than 512 levels.
+// None, with an error, when the text is no JSON (the error names line and column) or nests deeper than 512 levels.
 std::optional<Json> parseJson(std::string_view text, ErrorOut error);
 
 // Absent values (null) are left out.
@@ -36,6 +36,12 @@ Json jsonFromPropertyList(const PropertyList& value);
 
 // Writes a property list as indented JSON, piece by piece: it may be much larger written out than it is in memory.
 void writePropertyListAsJson(const PropertyList& value, const std::function<void(std::string_view)>& write);
+
+// The value, null where there is none.
+template <class Value>
+Json orNull(const std::optional<Value>& value) {
+  return value ? Json(*value) : Json(nullptr);
+}
 
 // Store accounts in the order of their ids, an object each; absent values are null.
 Json accountDocuments(std::vector<DovelMutableAccountInfo> accounts);

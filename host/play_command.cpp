@@ -145,8 +145,7 @@ class PlayRun {
     if (action == "zelkIDsForAssets") return arrayOf(client.zelkIDsForAssets());
     if (action == "accountsForAssets") return accountDocuments(client.accountsForAssets());
     if (action == "disabledAssetTypes") {
-      const auto types = client.disabledAssetTypes();
-      return types ? arrayOf(*types) : Json(nullptr);
+      return orNull(client.disabledAssetTypes());
     }
     callWithoutAnswer(action, arguments);
     return nullptr;

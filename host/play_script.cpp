@@ -241,10 +241,6 @@ std::optional<std::string> optionalText(const Json& object, const char* name) {
   return value == nullptr ? std::nullopt : std::optional(value->get<std::string>());
 }
 
-Json orNull(const std::optional<std::string>& text) {
-  return text ? Json(*text) : Json(nullptr);
-}
-
 }  // namespace
 
 std::optional<PlayScript> readPlayScript(const std::string& path, Failure& failure) {

@@ -127,11 +127,11 @@ Json documentOf(const RestoreReport& report) {
   for (const RestoredApplication& application : report.applications) {
     applications.push_back({{"identifier", application.identifier},
                             {"placeholder", application.installType.has_value()},
-                            {"installType", application.installType ? Json(*application.installType) : Json(nullptr)},
-                            {"error", application.error ? Json(*application.error) : Json(nullptr)}});
+                            {"installType", orNull(application.installType)},
+                            {"error", orNull(application.error)}});
   }
   return {{"ok", report.status() == kStatusDone},
-          {"error", report.error ? Json(*report.error) : Json(nullptr)},
+          {"error", orNull(report.error)},
           {"applications", applications},
           {"waited", report.waited.count()}};
 }

@@ -20,7 +20,6 @@ namespace appsync {
 
 namespace {
 
-constexpr char kTodoList[] = "/var/mobile/Library/ApplicationSync/TarvoStuff/ApplicationsSync.plist";
 constexpr char kAnchor[] = "dovel";
 constexpr auto kPatienceWithInstalls = std::chrono::seconds(30);  // without any progress
 

@@ -11,10 +11,6 @@ namespace appsync {
 
 namespace {
 
-Json orNull(const std::optional<std::string>& text) {
-  return text ? Json(*text) : Json(nullptr);
-}
-
 Json metric(const SyncReport& report, const char* key) {
   const PropertyList* value = report.metrics.find(key);
   return value == nullptr ? Json(0) : jsonFromPropertyList(*value);
