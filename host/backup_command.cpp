@@ -72,10 +72,9 @@ void printTexts(const char* title, const Json& texts, Console& console) {
 int runBackup(const BackupOptions& options, Console& console) {
   Failure failure;
   TidyListener listener;
-  const auto session = Session::open({.common = options.common, .listeners = {&listener}}, failure);
+  const auto session = Session::open({.common = options.common, .listeners = {&listener}}, console, failure);
   if (!session || !session->makeClient(failure)) return console.fail(failure);
   Device& device = session->device();
-  for (const std::string& line : device.repairs()) console.problem(line);
 
   DovelClient& client = session->client();
   client.prepareForBackup();
@@ -91,9 +90,10 @@ int runBackup(const BackupOptions& options, Console& console) {
       cleared.push_back(identifier);
     }
   }
+  const int status = session->exitStatus(untidy.empty() ? kStatusDone : kStatusSomethingFailed);
   if (!session->close(failure)) return console.fail(failure);
 
-  console.document({{"ok", untidy.empty()},
+  console.document({{"ok", status == kStatusDone},
                     {"zelkIDs", ids},
                     {"accounts", accounts},
                     {"disabledAssetTypes", orNull(disabled)},
@@ -106,7 +106,7 @@ int runBackup(const BackupOptions& options, Console& console) {
     console.problem("the store metadata of \"" + identifier +
                     "\" could not be tidied; make the device's directory writable");
   }
-  return untidy.empty() ? kStatusDone : kStatusSomethingFailed;
+  return status;
 }
 
 }  // namespace appsync

@@ -123,6 +123,18 @@ bool OutputFile::finish(Failure& failure) {
   return false;
 }
 
+int openOutput(const std::string& path, Failure& failure) {
+  const int file = ::open(path.c_str(), O_WRONLY | O_CREAT | O_APPEND | O_CLOEXEC, 0666);
+  if (file < 0) failure = outputFailure(path, errno);
+  return file;
+}
+
+int emptyOutput(int file) {
+  struct stat information {};
+  if (::fstat(file, &information) != 0) return errno;
+  return S_ISREG(information.st_mode) && ::ftruncate(file, 0) != 0 ? errno : 0;
+}
+
 Failure outputFailure(const std::string& path, int errorNumber) {
   return {FailureCode::OutputUnwritable, "\"" + path + "\" cannot be written: " + std::strerror(errorNumber),
           "name a file in a directory that exists and can be written"};

@@ -44,6 +44,13 @@ class OutputFile {
   std::string _buffer;
 };
 
+// Opens a file to write at its end, for outputs that grow while something runs; makes it if it is not there. What it
+// holds stays until `emptyOutput`, as the run may yet be refused. -1, with the failure said, when it cannot be written.
+int openOutput(const std::string& path, Failure& failure);
+
+// Takes away what a plain file holds. 0 or an error number.
+int emptyOutput(int file);
+
 Failure outputFailure(const std::string& path, int errorNumber);
 
 }  // namespace appsync

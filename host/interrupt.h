@@ -5,17 +5,22 @@
 #include <functional>
 #include <thread>
 
+#include "embedded/disk.h"
+#include "host/failure.h"
 #include "platform/thread_annotations.h"
 
 namespace appsync {
 
-// While one of these lives, signals 2 and 15 come to a thread of its own. To be made before any other thread is.
+// From its start to its end, signals 2 and 15 come to a thread of its own.
 class Interrupt {
  public:
-  Interrupt();
+  Interrupt() = default;
   ~Interrupt();
   Interrupt(const Interrupt&) = delete;
   Interrupt& operator=(const Interrupt&) = delete;
+
+  // Once, before any other thread is made. False, with the failure said, when signals cannot be watched.
+  bool start(Failure& failure);
 
   // 0, or the signal that has come.
   int signal() const { return _signal; }
@@ -31,8 +36,8 @@ class Interrupt {
   std::atomic<int> _signal{0};
   Mutex _mutex;
   std::function<void()> _handler APPSYNC_GUARDED_BY(_mutex);
-  int _signals = -1;  // file descriptors
-  int _stop = -1;
+  OwnedFile _signals;
+  OwnedFile _stop;
   std::thread _thread;
 };
 

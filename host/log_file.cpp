@@ -1,12 +1,12 @@
 #include "host/log_file.h"
 
-#include <fcntl.h>
 #include <unistd.h>
 
 #include <array>
 #include <cerrno>
 #include <cstdio>
 #include <ctime>
+#include <utility>
 
 #include "host/console.h"
 #include "host/files.h"
@@ -40,16 +40,19 @@ std::string escaped(std::string_view message) {
 
 std::unique_ptr<LogFile> LogFile::open(const std::string& path, Failure& failure) {
   if (path == "-") return std::unique_ptr<LogFile>(new LogFile(path, STDERR_FILENO));
-  const int file = ::open(path.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, 0666);
-  if (file < 0) {
-    failure = outputFailure(path, errno);
-    return nullptr;
-  }
+  const int file = openOutput(path, failure);
+  if (file < 0) return nullptr;
   return std::unique_ptr<LogFile>(new LogFile(path, file));
 }
 
 LogFile::~LogFile() {
   if (_file != STDERR_FILENO) ::close(_file);
+}
+
+void LogFile::begin() {
+  _hasBegun = true;
+  if (_file != STDERR_FILENO) _error = emptyOutput(_file);
+  if (_error == 0) _error = writeAll(_file, std::exchange(_early, {}));
 }
 
 void LogFile::line(const LogLine& line) {
@@ -68,7 +71,11 @@ void LogFile::add(std::chrono::system_clock::time_point time, LogLevel level, st
   text += category;
   text += '\t';
   text += escaped(message) + '\n';
-  _error = writeAll(_file, text);
+  if (_hasBegun) {
+    _error = writeAll(_file, text);
+  } else {
+    _early += text;
+  }
 }
 
 std::optional<Failure> LogFile::writeFailure() const {

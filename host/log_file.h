@@ -1,4 +1,6 @@
 // The file of --log: a line for each log line and transaction record.
+//
+// What stood in the file stays until `begin`; what is said before that is kept till then.
 #pragma once
 
 #include <memory>
@@ -16,6 +18,9 @@ class LogFile : public LogSink {
   static std::unique_ptr<LogFile> open(const std::string& path, Failure& failure);
   ~LogFile() override;
 
+  // From here on the file is this run's. Called once, while nobody logs.
+  void begin();
+
   void line(const LogLine& line) override;
   void transaction(const TransactionRecord& record) override;
 
@@ -29,6 +34,8 @@ class LogFile : public LogSink {
 
   const std::string _path;
   const int _file;
+  bool _hasBegun = false;
+  std::string _early;  // said before the beginning
   int _error = 0;
 };
 

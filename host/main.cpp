@@ -43,7 +43,8 @@ int carryOut(const Invocation& invocation, Console& console) {
 }  // namespace
 
 int main(int argumentCount, char** arguments) {
-  std::signal(SIGPIPE, SIG_IGN);
+  std::signal(SIGPIPE, SIG_IGN);  // these two are errors of writing, and reported as such
+  std::signal(SIGXFSZ, SIG_IGN);
   if (!openStandardStreams()) return appsync::kStatusUnusable;
   const Invocation invocation = appsync::parseCommandLine(argumentCount, arguments);
   Console console(invocation.json, invocation.quiet);

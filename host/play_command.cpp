@@ -98,6 +98,9 @@ class PlayRun {
   }
 
   const Json& steps() const { return _steps; }
+  // The same for people, a line each. To be printed when nothing can fail any more: a step may name a file that is not
+  // there, and then standard output stays empty.
+  const std::vector<std::string>& lines() const { return _lines; }
   // Whether the client answered a call with NO.
   bool wasRefused() const { return _wasRefused; }
 
@@ -119,8 +122,8 @@ class PlayRun {
     }
     Json shownError;
     if (error) shownError = {{"domain", error->domain()}, {"code", error->code()}};
-    _console.line(step.action + (result.is_null() ? "" : ": " + jsonLine(result)) +
-                  (error ? ", error " + error->description() : ""));
+    _lines.push_back(step.action + (result.is_null() ? "" : ": " + jsonLine(result)) +
+                     (error ? ", error " + error->description() : ""));
     _steps.push_back({{"do", step.action}, {"result", std::move(result)}, {"error", std::move(shownError)}});
     return true;
   }
@@ -254,7 +257,7 @@ class PlayRun {
     std::optional<Error> error;
     const std::string parent = std::filesystem::path(path).parent_path().string();
     if (files.createDirectory(parent, true, {}, &error) && files.writeFile(path, *bytes, &error)) return true;
-    failure = {FailureCode::InputUnusable, error->text(), "name an absolute path of the device with \"to\""};
+    failure = failureFrom(FailureCode::InputUnusable, *error, "name an absolute path of the device with \"to\"");
     return false;
   }
 
@@ -264,6 +267,7 @@ class PlayRun {
   Console& _console;
   ObservedWorkspace _workspace;
   Json _steps = Json::array();
+  std::vector<std::string> _lines;
   bool _wasRefused = false;
 };
 
@@ -274,17 +278,16 @@ int runPlay(const PlayOptions& options, Console& console) {
   const std::optional<PlayScript> script = readPlayScript(options.script, failure);
   if (!script) return console.fail(failure);
   const auto session = Session::open(
-      {.common = options.common, .mainBundleIdentifier = script->mainBundleIdentifier, .wrapsServices = true}, failure);
+      {.common = options.common, .mainBundleIdentifier = script->mainBundleIdentifier, .wrapsServices = true}, console,
+      failure);
   if (!session) return console.fail(failure);
 
   PlayRun run(*script, options.common.device, *session, console);
   if (!run.run(failure)) return console.fail(failure);
-  const bool wasInterrupted = session->interrupt().signal() != 0;
-  const int status = wasInterrupted     ? session->interrupt().exitStatus()
-                     : run.wasRefused() ? kStatusSomethingFailed
-                                        : kStatusDone;
+  const int status = session->exitStatus(run.wasRefused() ? kStatusSomethingFailed : kStatusDone);
   if (!session->close(failure)) return console.fail(failure);
   console.document({{"ok", status == kStatusDone}, {"steps", run.steps()}});
+  for (const std::string& line : run.lines()) console.line(line);
   return status;
 }
 

@@ -66,7 +66,6 @@ class RestoreRun {
 
   // False, with the failure said, when the restore could not begin.
   bool run(Failure& failure) {
-    for (const std::string& line : _device.repairs()) _console.problem(line);
     const CopySupervision supervision{[this](const std::string& line) { _console.problem(line); },
                                       [this] { return isInterrupted(); }};
     if (!_backup.push(_device.files(), supervision, failure)) return isInterrupted();
@@ -155,8 +154,9 @@ int runRestore(const RestoreOptions& options, Console& console) {
   const std::optional<BackupDirectory> backup = BackupDirectory::open(options.backup, options.common.device, failure);
   if (!backup) return console.fail(failure);
   RestoreProgress progress(console, canDrawInPlace(options.common, console));
-  const auto session = Session::open(
-      {.common = options.common, .mainBundleIdentifier = options.hostProcess, .listeners = {&progress}}, failure);
+  const auto session =
+      Session::open({.common = options.common, .mainBundleIdentifier = options.hostProcess, .listeners = {&progress}},
+                    console, failure);
   if (!session) return console.fail(failure);
 
   RestoreRun run(options, *backup, *session, progress, console);

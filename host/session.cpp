@@ -1,6 +1,9 @@
 #include "host/session.h"
 
+#include <sys/stat.h>
+
 #include <condition_variable>
+#include <filesystem>
 #include <mutex>
 #include <thread>
 
@@ -23,6 +26,20 @@ struct LastListener {
   bool heard = false;
 };
 
+// Whether two paths lead to one plain file, which may have to be made yet.
+bool areOneFile(const std::string& one, const std::string& other) {
+  struct stat first {};
+  struct stat second {};
+  const bool isThere = ::stat(one.c_str(), &first) == 0;
+  if (isThere != (::stat(other.c_str(), &second) == 0)) return false;
+  if (isThere) return S_ISREG(first.st_mode) && first.st_dev == second.st_dev && first.st_ino == second.st_ino;
+  const auto placeOf = [](const std::string& path) {
+    std::error_code unknown;
+    return std::filesystem::weakly_canonical(std::filesystem::absolute(path, unknown), unknown);
+  };
+  return one == other || (!placeOf(one).empty() && placeOf(one) == placeOf(other));
+}
+
 }  // namespace
 
 // Passes the log on to everybody who listens.
@@ -44,7 +61,7 @@ class Session::FanOut : public LogSink {
 
 Session::Session() = default;
 
-std::unique_ptr<Session> Session::open(const SessionOptions& options, Failure& failure) {
+std::unique_ptr<Session> Session::open(const SessionOptions& options, Console& console, Failure& failure) {
   Faults trial;
   for (const std::string& spec : options.common.faults) {
     std::optional<Error> error;
@@ -52,13 +69,22 @@ std::unique_ptr<Session> Session::open(const SessionOptions& options, Failure& f
     failure = failureFrom(FailureCode::UnknownFault, *error, "\"dovel faults\" lists the names");
     return nullptr;
   }
+  const auto& log = options.common.log;
+  const auto& trace = options.common.trace;
+  if (log && trace && log != "-" && areOneFile(*log, *trace)) {
+    failure = {FailureCode::CommandLine, "--log and --trace both name \"" + *log + "\"", "give each a file of its own"};
+    return nullptr;
+  }
   std::unique_ptr<Session> session(new Session);
-  if (!session->openOutputs(options, failure)) return nullptr;
-  if (options.loadsPlugin) {
+  if (!session->_interrupt.start(failure) || !session->openOutputs(options, failure)) return nullptr;
+  if (options.loadsPlugin || options.common.plugin) {
     session->_plugin = Plugin::load(options.common.plugin, failure);
     if (!session->_plugin) return nullptr;
   }
+  if (!options.opensDevice) return session;
   if (!session->openDevice(options, failure)) return nullptr;
+  session->beginOutputs();
+  for (const std::string& repair : session->device().repairs()) console.problem(repair);
   return session;
 }
 
@@ -151,6 +177,11 @@ std::optional<Error> Session::fault(const std::string& operation, const std::str
   return _instruments ? _instruments->faultQuery()(operation, identifier) : std::nullopt;
 }
 
+void Session::beginOutputs() {
+  if (_log) _log->begin();
+  if (_trace) _trace->begin();
+}
+
 bool Session::close(Failure& failure) {
   _client.reset();
   if (_device) {
@@ -161,6 +192,7 @@ bool Session::close(Failure& failure) {
   _instruments.reset();
   _device.reset();
   std::optional<Failure> unwritten = _log ? _log->writeFailure() : std::nullopt;
+  if (_trace) _trace->finish();
   if (!unwritten && _trace) unwritten = _trace->writeFailure();
   _trace.reset();
   _log.reset();

@@ -8,6 +8,7 @@
 #include <vector>
 
 #include "embedded/device.h"
+#include "host/console.h"
 #include "host/failure.h"
 #include "host/interrupt.h"
 #include "host/log_file.h"
@@ -23,14 +24,16 @@ struct SessionOptions {
   std::string mainBundleIdentifier = "com.zelk.dovel";
   std::vector<LogSink*> listeners = {};  // hear the log too; must outlive the session
   bool wrapsServices = false;            // the instruments are needed even without a fault
-  bool loadsPlugin = true;
+  bool loadsPlugin = true;               // a plug-in that the options name is loaded, and so checked, in any case
+  bool opensDevice = true;
 };
 
 class Session {
  public:
-  // Checks what can be checked, then opens the device. Null, with the failure said; nothing has been changed then but
-  // the log and trace files.
-  static std::unique_ptr<Session> open(const SessionOptions& options, Failure& failure);
+  // Checks what can be checked, then opens the device and tells on the console what that has repaired. Null, with the
+  // failure said: log and trace files are as they were then, made empty where they were not there; of a device that
+  // could not be made there may be a part.
+  static std::unique_ptr<Session> open(const SessionOptions& options, Console& console, Failure& failure);
   ~Session();
   Session(const Session&) = delete;
   Session& operator=(const Session&) = delete;
@@ -39,6 +42,9 @@ class Session {
   bool makeClient(Failure& failure);
   // The same on a platform that differs from `platform()`.
   bool makeClient(const Platform& platform, Failure& failure);
+
+  // From here on the log and trace files are this run's. Done by `open` when it has opened the device.
+  void beginOutputs();
 
   // Ends the client and then the device's work; after this the outputs are complete. Called again it does nothing.
   // False, with the failure said, when a log or trace file could not be written to its end.
@@ -50,6 +56,8 @@ class Session {
   Device& device() { return *_device; }
   DovelClient& client() { return *_client; }
   Interrupt& interrupt() { return _interrupt; }
+  // The exit status of a run that amounts to `status` unless it has been interrupted.
+  int exitStatus(int status) const { return _interrupt.signal() == 0 ? status : _interrupt.exitStatus(); }
   Instruments* instruments() { return _instruments.get(); }  // null when nothing needs them
   TraceFile* trace() { return _trace.get(); }                // null when none is wanted
   Platform platform();                                       // the one for the client

@@ -25,11 +25,13 @@ int runSettings(const SettingsOptions& options, Console& console) {
   std::optional<Error> error;
   std::optional<PropertyList> newValue;
   // A wrong key or value is found before the device is touched.
-  if (options.value) {
-    newValue = EmbeddedSettings::valueFromText(*options.key, *options.value, &error);
-    if (!newValue) return console.fail(settingFailure(*error));
+  if (options.key) {
+    newValue = EmbeddedSettings::valueFromText(*options.key, options.value.value_or(""), &error);
+    if (!newValue && (options.value || error->code() == kSettingsUnknownKey)) {
+      return console.fail(settingFailure(*error));
+    }
   }
-  const auto session = Session::open({.common = options.common, .loadsPlugin = false}, failure);
+  const auto session = Session::open({.common = options.common, .loadsPlugin = false}, console, failure);
   if (!session) return console.fail(failure);
   EmbeddedSettings& settings = session->device().settings();
   if (newValue && !settings.setValue(*options.key, *newValue, &error)) {
@@ -42,10 +44,11 @@ int runSettings(const SettingsOptions& options, Console& console) {
     values = PropertyList::dictionary();
     values.set(*options.key, *value);
   }
+  const int status = session->exitStatus(kStatusDone);
   if (!session->close(failure)) return console.fail(failure);
-  console.document({{"ok", true}, {"settings", jsonFromPropertyList(values)}});
+  console.document({{"ok", status == kStatusDone}, {"settings", jsonFromPropertyList(values)}});
   for (const auto member : values.members()) console.line(std::string(member.key) + " " + shown(member.value));
-  return kStatusDone;
+  return status;
 }
 
 }  // namespace appsync

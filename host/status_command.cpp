@@ -44,8 +44,8 @@ Json entryDocument(const PropertyList& entry, const Listing& listing) {
   return shown;
 }
 
-Json statusDocument(const PropertyList& status) {
-  Json document = {{"ok", true}};
+Json statusDocument(const PropertyList& status, bool ok) {
+  Json document = {{"ok", ok}};
   for (const Listing& listing : listings()) {
     Json& entries = document[listing.key] = Json::array();
     const PropertyList* found = status.find(listing.key);
@@ -103,12 +103,20 @@ void printIdentifiers(const Json& document, const char* key, Console& console) {
 }  // namespace
 
 int runStatus(const StatusOptions& options, Console& console) {
+  Failure failure;
+  const auto session =
+      Session::open({.common = options.common, .loadsPlugin = false, .opensDevice = false}, console, failure);
+  if (!session) return console.fail(failure);
   std::optional<Error> error;
   const std::optional<PropertyList> status = Device::status(options.common.device, &error);
   if (!status) return console.fail(deviceFailure(options.common.device, *error));
-  const Json document = statusDocument(*status);
+  session->beginOutputs();
+  const int exitStatus = session->exitStatus(kStatusDone);
+  if (!session->close(failure)) return console.fail(failure);
+
+  const Json document = statusDocument(*status, exitStatus == kStatusDone);
   console.document(document);
-  if (console.isJSON() || console.isQuiet()) return kStatusDone;
+  if (console.isJSON() || console.isQuiet()) return exitStatus;
   for (const Listing& listing : listings()) printTable(document, listing, console);
   printIdentifiers(document, "homeScreen", console);
   printIdentifiers(document, "uninstalled", console);
@@ -117,7 +125,7 @@ int runStatus(const StatusOptions& options, Console& console) {
     console.line("settings");
     for (const auto& [key, value] : document["settings"].items()) console.line("  " + key + " " + cell(value));
   }
-  return kStatusDone;
+  return exitStatus;
 }
 
 }  // namespace appsync

@@ -79,7 +79,6 @@ class SyncRun {
   bool isInterrupted() { return _session.interrupt().signal() != 0; }
 
   bool pushHost(Failure& failure) {
-    for (const std::string& line : _device.repairs()) _console.problem(line);
     clearStaging(_device.files(), _device.coordination().packagePathsInUse());
     const CopySupervision supervision{[this](const std::string& line) { _console.problem(line); },
                                       [this] { return isInterrupted(); }};
@@ -271,7 +270,7 @@ int runSync(const SyncOptions& options, Console& console) {
   SyncLog log;
   const std::optional<HostDirectory> host = HostDirectory::open(options.host, options.common.device, failure);
   if (!host) return console.fail(failure);
-  const auto session = Session::open({.common = options.common, .listeners = {&log}}, failure);
+  const auto session = Session::open({.common = options.common, .listeners = {&log}}, console, failure);
   if (!session) return console.fail(failure);
 
   SyncRun run(options, *host, *session, log, console);

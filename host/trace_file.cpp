@@ -1,6 +1,5 @@
 #include "host/trace_file.h"
 
-#include <fcntl.h>
 #include <unistd.h>
 
 #include <cerrno>
@@ -27,11 +26,8 @@ Json detailsOf(const TransactionRecord& record) {
 }  // namespace
 
 std::unique_ptr<TraceFile> TraceFile::open(const std::string& path, Failure& failure) {
-  const int file = ::open(path.c_str(), O_WRONLY | O_CREAT | O_TRUNC | O_CLOEXEC, 0666);
-  if (file < 0) {
-    failure = outputFailure(path, errno);
-    return nullptr;
-  }
+  const int file = openOutput(path, failure);
+  if (file < 0) return nullptr;
   return std::unique_ptr<TraceFile>(new TraceFile(path, file));
 }
 
@@ -41,26 +37,33 @@ TraceFile::TraceFile(std::string path, int file) : _path(std::move(path)), _file
   add({{"ph", "M"}, {"pid", kProcess}, {"name", "process_name"}, {"args", {{"name", "dovel"}}}});
 }
 
-// Where memory has run out the document stays without its end, and nothing else suffers.
 TraceFile::~TraceFile() {
-  try {
-    finish();
-  } catch (...) {
-  }
   ::close(_file);
+}
+
+void TraceFile::begin() {
+  MutexLock lock(_mutex);
+  _hasBegun = true;
+  _error = emptyOutput(_file);
+  write(std::exchange(_early, {}));
 }
 
 void TraceFile::finish() {
   MutexLock lock(_mutex);
-  const Time now = std::chrono::system_clock::now();
-  for (const auto& [key, steps] : _openSteps) {
-    for (const OpenStep& step : steps) {
-      Json details = detailsOf(step.record);
-      details["unfinished"] = true;
-      addSpan(key.first, step.record.description, step.begin, now, details);
+  if (!_hasBegun || std::exchange(_isFinished, true)) return;
+  try {
+    const Time now = std::chrono::system_clock::now();
+    for (const auto& [key, steps] : _openSteps) {
+      for (const OpenStep& step : steps) {
+        Json details = detailsOf(step.record);
+        details["unfinished"] = true;
+        addSpan(key.first, step.record.description, step.begin, now, details);
+      }
     }
+    write("\n]}\n");
+  } catch (const std::bad_alloc&) {
+    _error = ENOMEM;
   }
-  write("\n]}\n");
 }
 
 void TraceFile::transaction(const TransactionRecord& record) {
@@ -131,7 +134,11 @@ void TraceFile::add(const Json& event) {
 }
 
 void TraceFile::write(const std::string& text) {
-  if (_error == 0) _error = writeAll(_file, text);
+  if (!_hasBegun) {
+    _early += text;
+  } else if (_error == 0) {
+    _error = writeAll(_file, text);
+  }
 }
 
 }  // namespace appsync

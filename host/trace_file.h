@@ -1,5 +1,7 @@
 // The file of --trace: install transactions and transfers as Chrome trace events, every application on a track of its
 // own.
+//
+// What stood in the file stays until `begin`; what happens before that is kept till then.
 #pragma once
 
 #include <chrono>
@@ -24,8 +26,12 @@ class TraceFile : public LogSink {
 
   // Null, with the failure said, when it cannot be written.
   static std::unique_ptr<TraceFile> open(const std::string& path, Failure& failure);
-  // Ends the document.
   ~TraceFile() override;
+
+  // From here on the file is this run's. Called once.
+  void begin();
+  // Ends the document, and with it what is still open. Nothing may happen after this; called again it does nothing.
+  void finish();
 
   void line(const LogLine&) override {}
   void transaction(const TransactionRecord& record) override;
@@ -34,6 +40,7 @@ class TraceFile : public LogSink {
   void span(const std::string& identifier, const std::string& name, Time begin, const Json& details);
   void moment(const std::string& identifier, const std::string& name, const Json& details);
 
+  // Why not everything has been written, if so.
   std::optional<Failure> writeFailure() const;
 
  private:
@@ -46,7 +53,6 @@ class TraceFile : public LogSink {
   void addSpan(int track, const std::string& name, Time begin, Time end, const Json& details) APPSYNC_REQUIRES(_mutex);
   void addMoment(int track, const std::string& name, Time time, const Json& details) APPSYNC_REQUIRES(_mutex);
   int trackOf(const std::optional<std::string>& identifier) APPSYNC_REQUIRES(_mutex);
-  void finish();
   void add(const Json& event) APPSYNC_REQUIRES(_mutex);
   void write(const std::string& text) APPSYNC_REQUIRES(_mutex);
 
@@ -54,6 +60,9 @@ class TraceFile : public LogSink {
   const int _file;
   mutable Mutex _mutex;
   int _error APPSYNC_GUARDED_BY(_mutex) = 0;
+  bool _hasBegun APPSYNC_GUARDED_BY(_mutex) = false;
+  bool _isFinished APPSYNC_GUARDED_BY(_mutex) = false;
+  std::string _early APPSYNC_GUARDED_BY(_mutex);  // from before the beginning
   bool _hasEvents APPSYNC_GUARDED_BY(_mutex) = false;
   std::map<std::string, int> _tracks APPSYNC_GUARDED_BY(_mutex);
   std::map<std::pair<int, std::int32_t>, std::vector<OpenStep>> _openSteps APPSYNC_GUARDED_BY(_mutex);
