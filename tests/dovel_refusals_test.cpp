@@ -8,10 +8,12 @@
 #include <filesystem>
 
 #include "embedded/disk.h"
-#include "tests/support/dovel_run.h"
+#include "tests/support/program.h"
 
 namespace appsync::test {
 namespace {
+
+class RefusalsTest : public ProgramTest {};
 
 // Runs the program with a limit on how large its files may grow, which it inherits.
 Outcome dovelWithLimit(rlim_t largestFile, const Arguments& arguments) {
@@ -24,7 +26,7 @@ Outcome dovelWithLimit(rlim_t largestFile, const Arguments& arguments) {
   return run;
 }
 
-TEST_F(DovelTest, AHostAndADeviceWithinEachOtherAreRefusedAndKept) {
+TEST_F(RefusalsTest, AHostAndADeviceWithinEachOtherAreRefusedAndKept) {
   const std::string host = sampleHost("host", 1, 1);
   ASSERT_EQ(sync(host).status, 0);
   const std::string staging = at("device/var/mobile/Media/PublicStaging");
@@ -54,7 +56,7 @@ TEST_F(DovelTest, AHostAndADeviceWithinEachOtherAreRefusedAndKept) {
   EXPECT_EQ(dovel({"sync", "--device", at("host.device"), host}).status, 0) << "beside each other is apart";
 }
 
-TEST_F(DovelTest, ARefusedRunChangesNothing) {
+TEST_F(RefusalsTest, ARefusedRunChangesNothing) {
   const std::string host = sampleHost("host", 1, 1);
   ASSERT_EQ(sync(host).status, 0);
   ASSERT_EQ(dovel({"settings", "--device", at("busy")}).status, 0);
@@ -103,7 +105,7 @@ TEST_F(DovelTest, ARefusedRunChangesNothing) {
   EXPECT_EQ(std::distance(fs::directory_iterator(at("ten/Packages")), {}), 10);
 }
 
-TEST_F(DovelTest, AFailureOnTheWayIsSaidWithItsCureAndNothingElse) {
+TEST_F(RefusalsTest, AFailureOnTheWayIsSaidWithItsCureAndNothingElse) {
   const std::string host = sampleHost("host", 1, 1);
   const Outcome played = play(R"({"steps": [{"do": "supportedDataclasses"}, {"do": "stage", "host": "none"}]})", {});
   EXPECT_EQ(played.status, 3);
@@ -130,7 +132,7 @@ TEST_F(DovelTest, AFailureOnTheWayIsSaidWithItsCureAndNothingElse) {
   }
 }
 
-TEST_F(DovelTest, WhatADeviceRepairsIsSaidByEveryCommandAndFailsNone) {
+TEST_F(RefusalsTest, WhatADeviceRepairsIsSaidByEveryCommandAndFailsNone) {
   write(at("empty.json"), "{}");
   write(at("script.json"), R"({"steps": []})");
   fs::create_directories(at("host"));
