@@ -18,8 +18,8 @@ inline constexpr char kBackupDemotedApps[] = "com.zelk.Vaultry.DemotedApps.plist
 
 class BackupDirectory {
  public:
-  // None, with the failure said, when there is no such directory, or when it and that of the device lie one in the
-  // other.
+  // None, with the failure said, when there is no such directory, or when it and that of the device lie in each other
+  // (see `openSource`).
   static std::optional<BackupDirectory> open(const std::string& path, const std::string& device, Failure& failure);
 
   // Puts a copy of its lists in place on the device; what the backup lacks is not there afterwards either. False, with

@@ -34,7 +34,7 @@ std::vector<Identity> lineOf(int directory) {
 }
 
 // Why the device cannot take anything from a directory; empty when it can.
-std::string whyTooClose(int source, const std::string& device) {
+std::string whyTooClose(const SourceKind& kind, int source, const std::string& device) {
   const std::vector<Identity> sourceLine = lineOf(source);
   std::filesystem::path path = device;
   OwnedFile nearest;  // the device's directory, or the first one above it that is there
@@ -49,7 +49,13 @@ std::string whyTooClose(int source, const std::string& device) {
     return !other.empty() && std::find(line.begin(), line.end(), other.front()) != line.end();
   };
   if (isThere && liesIn(sourceLine, deviceLine)) return "it lies in the device \"" + device + "\"";
-  if (liesIn(deviceLine, sourceLine)) return "the device \"" + device + "\" lies in it";
+  Disk disk;
+  for (const char* name : kind.parts) {
+    const OwnedFile part = openDirectoryAt(disk, source, name);
+    if (part && liesIn(deviceLine, lineOf(part.get()))) {
+      return "the device \"" + device + "\" lies in its \"" + name + "\"";
+    }
+  }
   return "";
 }
 
@@ -63,7 +69,7 @@ OwnedFile openSource(const SourceKind& kind, const std::string& path, const std:
     return OwnedFile();
   };
   if (!directory) return refuse(std::strerror(errno), "name a directory that holds " + std::string(kind.content));
-  const std::string tooClose = whyTooClose(directory.get(), device);
+  const std::string tooClose = whyTooClose(kind, directory.get(), device);
   if (!tooClose.empty()) return refuse(tooClose, "keep it and the device in directories apart from each other");
   return directory;
 }

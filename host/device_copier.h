@@ -3,6 +3,7 @@
 
 #include <cstddef>
 #include <functional>
+#include <span>
 #include <string>
 #include <vector>
 
@@ -52,11 +53,13 @@ class DeviceCopier {
 // What messages say of a directory to copy from.
 struct SourceKind {
   const char* name;
-  const char* content;  // what it has to hold
+  const char* content;                      // what it has to hold
+  std::span<const char* const> parts = {};  // its directories that are read whole
 };
 
-// Opens a directory to copy from. None, with the failure said, when it cannot be opened, and when it lies in the
-// device's directory or that in it: clearing the device would clear what is to be copied.
+// Opens a directory to copy from. None, with the failure said, when it cannot be opened, when it lies in the device's
+// directory, where clearing the staging area would clear it, or that in one of its parts, which would be copied into
+// itself.
 OwnedFile openSource(const SourceKind& kind, const std::string& path, const std::string& device, Failure& failure);
 
 // A plain file below a directory. None, with errno, for everything else.

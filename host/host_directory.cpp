@@ -18,7 +18,8 @@ namespace {
 constexpr char kIncoming[] = "/var/mobile/Media/PublicStaging/.ApplicationSync.incoming";
 constexpr char kLastSyncDirectory[] = "/var/mobile/Library/ApplicationSync";
 constexpr char kLastSyncList[] = "LastSyncAppState.plist";
-constexpr SourceKind kHost{"host directory", "ApplicationSync and Packages"};
+constexpr const char* kParts[] = {"ApplicationSync", "Packages"};
+constexpr SourceKind kHost{"host directory", "ApplicationSync and Packages", kParts};
 
 // Whether this error of opening a package tells that there is no such plain file, and no name that could have one.
 bool tellsOfNoFile(int error) {

@@ -20,8 +20,8 @@ inline constexpr char kPackageDirectory[] = "/var/mobile/Media/PublicStaging/Pac
 
 class HostDirectory {
  public:
-  // None, with the failure said, when there is no such directory, or when it and that of the device lie one in the
-  // other.
+  // None, with the failure said, when there is no such directory, or when it and that of the device lie in each other
+  // (see `openSource`).
   static std::optional<HostDirectory> open(const std::string& path, const std::string& device, Failure& failure);
 
   // Puts a copy of "ApplicationSync" into the staging area, in one step once it is whole, and the last-sync list to its
