@@ -371,7 +371,7 @@ TEST(Restore, TheWaitIsBoundedByTheAnnouncedPlaceholders) {
     EXPECT_NE(lines.find("getting dealloc'd with [org.b]pending placeholder install"), std::string::npos) << lines;
   }
   {
-    World world(kMigrator);  // a placeholder that the registry cannot take: the service gives the application up
+    World world(kMigrator);  // each is reported twice
     ScriptedAnswers answers;
     answers.event = [](const std::string& event, const std::string&) {
       return event == "coordinatorDidInstallPlaceholder" ? EventFate::Double : EventFate::Deliver;
