@@ -34,7 +34,11 @@ void Console::line(std::string_view text) {
 }
 
 void Console::failureLine(std::string_view text) {
-  if (!_json) raw(printable(text) + "\n");
+  if (!_json && !_isMute) raw(printable(text) + "\n");
+}
+
+void Console::picture(std::string_view bytes) {
+  if (!_isMute) raw(bytes);
 }
 
 void Console::raw(std::string_view bytes) {

@@ -29,8 +29,12 @@ class Console {
   void line(std::string_view text);
   // The same, but said when it is to be quiet too, as it tells of a failure.
   void failureLine(std::string_view text);
+  // Bytes that draw on the terminal.
+  void picture(std::string_view bytes);
   // Bytes as they are, whatever the options say.
   void raw(std::string_view bytes);
+  // From now on there are no lines and no pictures: the run is to fail as a whole.
+  void mute() { _isMute = true; }
   // The one document of a command, with JSON only. "schema" is put in front.
   void document(const Json& fields);
   // A line on standard error, after the program's name. Made printable.
@@ -45,6 +49,7 @@ class Console {
  private:
   const bool _json;
   const bool _quiet;
+  std::atomic<bool> _isMute = false;
   std::atomic<int> _outputError = 0;
 };
 

@@ -128,7 +128,7 @@ void ProgressDisplay::draw() {
   }
   picture += "\x1b[J";
   _drawnLines = rows.size() + (rows.size() < _rows.size() ? 1 : 0);
-  _console.raw(picture);
+  _console.picture(picture);
 }
 
 // All rows when there is room; otherwise those that move come first, then those that wait.

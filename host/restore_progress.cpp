@@ -213,19 +213,19 @@ void RestoreProgress::drawWait() {
     std::string text = waitText();
     const std::size_t room = _console.columns() - 4;  // the terminal shows "^C" behind it
     if (displayWidth(text) > room) text = fitted(text, room);
-    _console.raw("\r\x1b[K" + text);
+    _console.picture("\r\x1b[K" + text);
     _isDrawn = true;
     _changed.wait_for(lock.native(), std::chrono::seconds(1),
                       [this]() APPSYNC_NO_THREAD_ANALYSIS { return !_isWaiting || !_isDrawn; });
   }
-  if (_isDrawn) _console.raw("\r\x1b[K");
+  if (_isDrawn) _console.picture("\r\x1b[K");
   _isDrawn = false;
 }
 
 // The line of the wait makes room and is drawn again below.
 void RestoreProgress::print(const std::string& text, bool isFailure) {
   if (_isDrawn) {
-    _console.raw("\r\x1b[K");
+    _console.picture("\r\x1b[K");
     _isDrawn = false;
     _changed.notify_all();
   }

@@ -42,21 +42,34 @@ bool areOneFile(const std::string& one, const std::string& other) {
 
 }  // namespace
 
-// Passes the log on to everybody who listens.
+// Passes the log on to everybody who listens, to the files first: when one of them fails, so will the run, and nothing
+// more is shown of it.
 class Session::FanOut : public LogSink {
  public:
-  explicit FanOut(std::vector<LogSink*> listeners) : _listeners(std::move(listeners)) {}
+  FanOut(Session& session, std::vector<LogSink*> listeners, Console& console)
+      : _session(session), _listeners(std::move(listeners)), _console(console) {}
 
-  bool isListening() override { return !_listeners.empty(); }
+  bool isListening() override { return !_listeners.empty() || _session._log || _session._trace; }
   void line(const LogLine& line) override {
+    if (_session._log) _session._log->line(line);
+    muteAfterFailure();
     for (LogSink* listener : _listeners) listener->line(line);
   }
   void transaction(const TransactionRecord& record) override {
+    if (_session._log) _session._log->transaction(record);
+    if (_session._trace) _session._trace->transaction(record);
+    muteAfterFailure();
     for (LogSink* listener : _listeners) listener->transaction(record);
   }
 
  private:
+  void muteAfterFailure() {
+    if (_session.outputFailure()) _console.mute();
+  }
+
+  Session& _session;
   const std::vector<LogSink*> _listeners;
+  Console& _console;
 };
 
 Session::Session() = default;
@@ -76,7 +89,7 @@ std::unique_ptr<Session> Session::open(const SessionOptions& options, Console& c
     return nullptr;
   }
   std::unique_ptr<Session> session(new Session);
-  if (!session->_interrupt.start(failure) || !session->openOutputs(options, failure)) return nullptr;
+  if (!session->_interrupt.start(failure) || !session->openOutputs(options, console, failure)) return nullptr;
   if (options.loadsPlugin || options.common.plugin) {
     session->_plugin = Plugin::load(options.common.plugin, failure);
     if (!session->_plugin) return nullptr;
@@ -84,6 +97,7 @@ std::unique_ptr<Session> Session::open(const SessionOptions& options, Console& c
   if (!options.opensDevice) return session;
   if (!session->openDevice(options, failure)) return nullptr;
   session->beginOutputs();
+  if (session->outputFailure()) console.mute();
   for (const std::string& repair : session->device().repairs()) console.problem(repair);
   return session;
 }
@@ -93,20 +107,22 @@ Session::~Session() {
   close(ignored);
 }
 
-bool Session::openOutputs(const SessionOptions& options, Failure& failure) {
-  std::vector<LogSink*> listeners = options.listeners;
+bool Session::openOutputs(const SessionOptions& options, Console& console, Failure& failure) {
   if (options.common.log) {
     _log = LogFile::open(*options.common.log, failure);
     if (!_log) return false;
-    listeners.push_back(_log.get());
   }
   if (options.common.trace) {
     _trace = TraceFile::open(*options.common.trace, failure);
     if (!_trace) return false;
-    listeners.push_back(_trace.get());
   }
-  _sink = std::make_unique<FanOut>(std::move(listeners));
+  _sink = std::make_unique<FanOut>(*this, options.listeners, console);
   return true;
+}
+
+std::optional<Failure> Session::outputFailure() const {
+  std::optional<Failure> failure = _log ? _log->writeFailure() : std::nullopt;
+  return failure || !_trace ? failure : _trace->writeFailure();
 }
 
 bool Session::openDevice(const SessionOptions& options, Failure& failure) {
@@ -191,9 +207,8 @@ bool Session::close(Failure& failure) {
   _interrupt.setHandler(nullptr);
   _instruments.reset();
   _device.reset();
-  std::optional<Failure> unwritten = _log ? _log->writeFailure() : std::nullopt;
   if (_trace) _trace->finish();
-  if (!unwritten && _trace) unwritten = _trace->writeFailure();
+  const std::optional<Failure> unwritten = outputFailure();
   _trace.reset();
   _log.reset();
   if (unwritten) failure = *unwritten;

@@ -71,7 +71,8 @@ class Session {
   class FanOut;
 
   Session();
-  bool openOutputs(const SessionOptions& options, Failure& failure);
+  bool openOutputs(const SessionOptions& options, Console& console, Failure& failure);
+  std::optional<Failure> outputFailure() const;  // why the log or the trace cannot be written, if so
   bool openDevice(const SessionOptions& options, Failure& failure);
 
   Interrupt _interrupt;
