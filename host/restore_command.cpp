@@ -135,7 +135,12 @@ Json documentOf(const RestoreReport& report) {
           {"waited", report.waited.count()}};
 }
 
-void printSummary(const RestoreReport& report, Console& console) {
+void printSummary(const RestoreReport& report, std::int32_t type, Console& console) {
+  if (report.applications.empty() && !report.error) {
+    const bool isKnown = type == 2 || type == 3;
+    console.line(isKnown ? "The backup lists no applications."
+                         : "A restore of type " + std::to_string(type) + " brings none back; types 2 and 3 do.");
+  }
   const auto count = [&](State state) { return std::to_string(report.counts.at(static_cast<std::size_t>(state))); };
   std::array<char, 32> seconds{};
   std::snprintf(seconds.data(), seconds.size(), "%.1f s", report.waited.count());
@@ -166,7 +171,7 @@ int runRestore(const RestoreOptions& options, Console& console) {
   if (report.error) console.problem(*report.error);
   for (const std::string& line : progress.otherProblems()) console.problem(line);
   console.document(documentOf(report));
-  printSummary(report, console);
+  printSummary(report, options.type, console);
   return report.status();
 }
 

@@ -7,6 +7,7 @@
 #include <cerrno>
 #include <filesystem>
 #include <memory>
+#include <mutex>
 #include <stdexcept>
 #include <string>
 #include <vector>
@@ -20,11 +21,12 @@
 
 namespace appsync::test {
 
-// Fails one call, or that one and all that follow, as after a crash: counted are the calls that change something.
+// Fails one call, or that one and all that follow, as after a crash: counted are the calls that change something. Any
+// thread.
 class FailingDisk : public Disk {
  public:
-  int failingCall = 0;  // 1 is the next one; 0: none
-  bool forGood = false;
+  std::atomic<int> failingCall = 0;  // 1 is the next one; 0: none
+  std::atomic<bool> forGood = false;
 
   ssize_t write(int file, const void* bytes, std::size_t size) override {
     return fails() ? -1 : Disk::write(file, bytes, size);
@@ -46,10 +48,13 @@ class FailingDisk : public Disk {
  private:
   bool fails() {
     errno = ENOSPC;
+    const std::lock_guard<std::mutex> lock(_counting);
     if (failingCall == 0 || failingCall-- > 1) return false;
     failingCall = forGood ? 1 : 0;
     return true;
   }
+
+  std::mutex _counting;
 };
 
 struct RegistryDevice {
