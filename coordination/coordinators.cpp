@@ -96,8 +96,8 @@ OstrelPromisedTransferToPath AppsClient::_createAppAssetPromiseForBundleIdentifi
 }
 
 OstrelPromisedOutOfBandTransfer AppsClient::_userDataPromiseForBundleIdentifier(const std::string& bundleID) {
-  const auto promise = OstrelPromisedOutOfBandTransfer::initWithName(*_platform.coordination, bundleID + "-UserData",
-                                                                     OstrelClientDovel, 0);
+  auto promise = OstrelPromisedOutOfBandTransfer::initWithName(*_platform.coordination, bundleID + "-UserData",
+                                                               OstrelClientDovel, 0);
   promise.setPercentComplete(1.0);
   promise.setComplete(true);
   return promise;
