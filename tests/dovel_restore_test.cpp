@@ -236,6 +236,23 @@ TEST_F(RestoreRunTest, BeforeABackupTheFlagGoesAndAccountsAreTold) {
   EXPECT_NE(text.find("accounts (3)\n"), std::string::npos) << text;
 }
 
+TEST_F(RestoreRunTest, ASampleBackupHasEveryKindAndIsTheSameEachTime) {
+  for (const char* name : {"one", "other"}) {
+    ASSERT_EQ(dovel({"sample", "--backup", at(name), "--apps", "5", "--seed", "7"}).status, 0);
+  }
+  EXPECT_EQ(treeOf(at("one")), treeOf(at("other")));
+  EXPECT_EQ(column(restore(at("one")).json()["applications"], "installType"), (Texts{"2", "7", "8", "2", "7"}));
+  const Json shown = dovel({"plist", at("one/RestoreApplications.plist"), "--to", "json"}).json();
+  EXPECT_FALSE(shown["org.sample.maps"].contains("PlaceholderIcon"));
+  const Json told = backUp().json();
+  EXPECT_EQ(told["cleared"].size(), 5U);
+  EXPECT_EQ(told["zelkIDs"], Json({"first@example.org", "second@example.org"}));
+  EXPECT_EQ(restore(at("nothing-there")).status, 3);
+  EXPECT_NE(
+      dovel({"restore", "--device", at("device"), "--type", "9", at("one")}).out.find("A restore of type 9 brings"),
+      std::string::npos);
+}
+
 TEST_F(RestoreRunTest, AScriptRestoresAndAsks) {
   sampleBackup();
   const Outcome run = play(R"({"host": "com.zelk.datamigrator", "steps": [
