@@ -82,6 +82,9 @@ class EmbeddedCoordination : public OstrelService {
   // Lets the coordinators work, those of an earlier process too.
   void startWork();
 
+  // Begins no further placeholder or install: what is being done is finished, the rest is a later process's.
+  void stopWork();
+
   // Finishes the work that is queued, writes down what is not yet written and begins nothing more: no callback runs
   // when this returns, and none is to come. Not to be called from a callback.
   void drain();

@@ -81,6 +81,11 @@ void EmbeddedCoordination::startWork() {
   for (const auto& [bundleID, coordinator] : _coordinators) consider(coordinator);
 }
 
+void EmbeddedCoordination::stopWork() {
+  MutexLock lock(_mutex);
+  _working = false;
+}
+
 void EmbeddedCoordination::consider(const std::shared_ptr<InstallCoordinator>& coordinator) {
   if (coordinator->isScheduled || _drained || nextStep(*coordinator) == Step::None) return;
   coordinator->isScheduled = true;

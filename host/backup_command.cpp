@@ -49,6 +49,7 @@ bool isUntidy(Device& device, const std::string& identifier) {
 
 std::string cell(const Json& value) {
   if (value.is_null()) return "-";
+  if (value == "") return "(empty)";
   return printable(value.is_string() ? value.get<std::string>() : jsonLine(value));
 }
 

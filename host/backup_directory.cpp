@@ -13,6 +13,9 @@ namespace {
 struct List {
   const char* name;
   const char* directory;
+
+  std::string place() const { return std::string(directory) + "/" + name; }
+  std::string incoming() const { return std::string(directory) + "/." + name + ".incoming"; }
 };
 
 constexpr SourceKind kBackup{"backup directory", kBackupRestoreList};
@@ -21,6 +24,19 @@ constexpr List kLists[] = {
     {kBackupRestoreList, "/var/mobile/Media/TarvoRestore"},
     {kBackupDemotedApps, "/var/mobile/Library/Preferences"},
 };
+
+bool notWritable(const Error& error, Failure& failure) {
+  failure = failureFrom(FailureCode::DeviceUnusable, error, "make the device's directory writable");
+  return false;
+}
+
+// What has been copied takes the place of what is there; where nothing has been copied that goes.
+bool putInPlace(EmbeddedFileManager& files, const List& list, Failure& failure) {
+  std::optional<Error> error;
+  bool done = !files.fileExists(list.place()) || files.removeItem(list.place(), &error);
+  if (done && files.fileExists(list.incoming())) done = files.moveItem(list.incoming(), list.place(), &error);
+  return done || notWritable(*error, failure);
+}
 
 }  // namespace
 
@@ -32,19 +48,26 @@ std::optional<BackupDirectory> BackupDirectory::open(const std::string& path, co
 }
 
 bool BackupDirectory::push(EmbeddedFileManager& files, const CopySupervision& supervision, Failure& failure) const {
+  const bool isCopied = copyLists(files, supervision, failure);
+  for (const List& list : kLists) {
+    if (isCopied && !putInPlace(files, list, failure)) return false;
+    if (!isCopied && files.fileExists(list.incoming())) files.removeItem(list.incoming(), nullptr);
+  }
+  return isCopied;
+}
+
+// Beside their places, so that a list that cannot be read leaves those of an earlier backup as they are.
+bool BackupDirectory::copyLists(EmbeddedFileManager& files, const CopySupervision& supervision,
+                                Failure& failure) const {
   DeviceCopier copier(_path, files, supervision, failure);
   for (const List& list : kLists) {
-    const std::string target = std::string(list.directory) + "/" + list.name;
     std::optional<Error> error;
     bool done = files.createDirectory(list.directory, true, {}, &error);
-    if (done && files.fileExists(target)) done = files.removeItem(target, &error);
-    if (!done) {
-      failure = failureFrom(FailureCode::DeviceUnusable, *error, "make the device's directory writable");
-      return false;
-    }
+    if (done && files.fileExists(list.incoming())) done = files.removeItem(list.incoming(), &error);
+    if (!done) return notWritable(*error, failure);
     struct stat information {};
     if (::fstatat(_directory->get(), list.name, &information, AT_SYMLINK_NOFOLLOW) != 0 && errno == ENOENT) continue;
-    if (!copier.copyFile(_directory->get(), list.name, target)) return false;
+    if (!copier.copyFile(_directory->get(), list.name, list.incoming())) return false;
   }
   return true;
 }

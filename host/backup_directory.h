@@ -18,13 +18,12 @@ inline constexpr char kBackupDemotedApps[] = "com.zelk.Vaultry.DemotedApps.plist
 
 class BackupDirectory {
  public:
-  // None, with the failure said, when there is no such directory, or when it and that of the device lie in each other
-  // (see `openSource`).
+  // None, with the failure said, when there is no such directory, or when it lies in the device's.
   static std::optional<BackupDirectory> open(const std::string& path, const std::string& device, Failure& failure);
 
   // Puts a copy of its lists in place on the device; what the backup lacks is not there afterwards either. False, with
   // the failure said, when something cannot be read or written, or when it was stopped (then the failure stays
-  // untouched).
+  // untouched); of a backup that cannot be read nothing is put in place.
   bool push(EmbeddedFileManager& files, const CopySupervision& supervision, Failure& failure) const;
 
   const std::string& path() const { return _path; }
@@ -32,6 +31,7 @@ class BackupDirectory {
  private:
   BackupDirectory(std::string path, std::shared_ptr<OwnedFile> directory)
       : _path(std::move(path)), _directory(std::move(directory)) {}
+  bool copyLists(EmbeddedFileManager& files, const CopySupervision& supervision, Failure& failure) const;
 
   std::string _path;
   std::shared_ptr<OwnedFile> _directory;

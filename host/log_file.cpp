@@ -10,6 +10,7 @@
 
 #include "host/console.h"
 #include "host/files.h"
+#include "host/text.h"
 
 namespace appsync {
 
@@ -45,6 +46,8 @@ std::unique_ptr<LogFile> LogFile::open(const std::string& path, Failure& failure
   return std::unique_ptr<LogFile>(new LogFile(path, file));
 }
 
+LogFile::LogFile(std::string path, int file) : _path(std::move(path)), _file(file), _isTerminal(::isatty(file) == 1) {}
+
 LogFile::~LogFile() {
   if (_file != STDERR_FILENO) ::close(_file);
 }
@@ -70,7 +73,7 @@ void LogFile::add(std::chrono::system_clock::time_point time, LogLevel level, st
   text += level == LogLevel::Error ? "\terror\t" : "\tdefault\t";
   text += category;
   text += '\t';
-  text += escaped(message) + '\n';
+  text += (_isTerminal ? printable(escaped(message)) : escaped(message)) + '\n';
   if (_hasBegun) {
     _error = writeAll(_file, text);
   } else {

@@ -28,12 +28,13 @@ class LogFile : public LogSink {
   std::optional<Failure> writeFailure() const;
 
  private:
-  LogFile(std::string path, int file) : _path(std::move(path)), _file(file) {}
+  LogFile(std::string path, int file);
   void add(std::chrono::system_clock::time_point time, LogLevel level, std::string_view category,
            std::string_view message);
 
   const std::string _path;
   const int _file;
+  const bool _isTerminal;  // it is shown nothing that it would obey
   bool _hasBegun = false;
   std::string _early;  // said before the beginning
   int _error = 0;

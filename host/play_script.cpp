@@ -207,6 +207,11 @@ std::string readStep(const Json& content, PlayStep& step) {
         return "\"" + step.action + "\" does not take \"" + key + "\"";
       }
     }
+    const std::int64_t type = numberArgument(content, "type");
+    if (step.action == "reconcileSync" && type < 0) return "has a \"type\" below 0";
+    if (step.action == "reconcileRestoreOfType" && type > std::numeric_limits<std::int32_t>::max()) {
+      return "has a \"type\" that is larger than a signed number of 32 bits";
+    }
     return "";
   }
   return "there is nothing called \"" + step.action + "\" to do";

@@ -80,6 +80,7 @@ class RestoreRun {
     std::optional<Error> error;
     _report.agreed = _session.client().reconcileRestoreOfType(_options.type, &error);
     if (error) _report.error = reasonText(*error);
+    if (isInterrupted()) _device.coordination().stopWork();
     return true;
   }
 
@@ -108,6 +109,7 @@ class RestoreRun {
     if (placeholder) result.installType = placeholder->installType;
     if (!application.why.empty()) result.error = application.why;
     if (application.state == State::SetUp) result.error = "its placeholder has not been installed";
+    if (application.state == State::Present && !placeholder) result.error = "the store is responsible for it";
     result.hasFailed = application.state == State::Failed || application.state == State::SetUp;
     return result;
   }

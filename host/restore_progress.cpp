@@ -20,6 +20,7 @@ constexpr std::string_view kBegins = "processing tarvo restore info for '%{publi
 constexpr std::string_view kNoInfo = "no tarvo restore info for '%{public}@' - skipping";
 constexpr std::string_view kNoMetadata = "no TarvoMetadata for '%{public}@' - ignoring";
 constexpr std::string_view kPlaceholderMade = "Created placeholder %{public}@ for '%{public}@' of type %lu";
+constexpr std::string_view kTheStores = "App asset DRI for %{public}@ is set to %lu - nothing more for dovel to do";
 constexpr std::string_view kAnnounced =
     "DataMigrator will wait for Ostrel to install placeholder for %{public}@, _restoringPlaceholderCount %lld";
 constexpr std::string_view kListUnreadable = "failed to read tarvo app restore info. err=%{public}@";
@@ -49,6 +50,18 @@ constexpr std::array kReasonLines{
 std::string lastArgument(std::string_view format, std::string_view message) {
   const auto arguments = argumentsOfLine(format, message);
   return arguments && !arguments->empty() ? arguments->back() : std::string(message);
+}
+
+// The reason that a line of this application tells. The identifier is what it is, whatever it looks like.
+std::string reasonIn(std::string_view message, const ReasonLine& line, const std::string& identifier) {
+  constexpr std::string_view kObject = "%{public}@";
+  const std::size_t object = line.format.find(kObject);
+  const std::string head(line.format.substr(0, object));
+  std::string tail(line.format.substr(object + kObject.size()));
+  if (line.isLast) return lastArgument(tail, message.substr(std::min(message.size(), head.size() + identifier.size())));
+  tail.replace(tail.find(kObject), kObject.size(), identifier);
+  if (message.size() < head.size() + tail.size()) return std::string(message);
+  return std::string(message.substr(head.size(), message.size() - head.size() - tail.size()));
 }
 
 // The number at the end of a line.
@@ -115,14 +128,14 @@ void RestoreProgress::line(const LogLine& line) {
     change(current, State::Skipped, "its entry in the list has no TarvoMetadata");
   } else if (line.format == kPlaceholderMade) {
     current.installType = lastNumber(message);
+  } else if (line.format == kTheStores) {
+    current.isTheStores = true;
   } else if (line.format == kAnnounced) {
     change(current, State::SetUp, "");
   }
   for (const ReasonLine& reason : kReasonLines) {
     if (line.format != reason.format) continue;
-    const auto arguments = argumentsOfLine(line.format, message);
-    if (!arguments || arguments->empty()) continue;
-    const std::string& text = reason.isLast ? arguments->back() : arguments->front();
+    const std::string text = reasonIn(message, reason, current.identifier);
     if (text != "(null)") _reason = text;
   }
 }
@@ -133,7 +146,7 @@ void RestoreProgress::begin(std::string_view message) {
   if (message.size() < from || to == std::string_view::npos) return;
   const std::string identifier(message.substr(from, to - from));
   _places[identifier] = _applications.size();
-  _applications.push_back({identifier, State::Begun, "", std::nullopt});
+  _applications.push_back({identifier, State::Begun, "", false, std::nullopt});
   _reason.clear();
 }
 
@@ -152,11 +165,13 @@ void RestoreProgress::transaction(const TransactionRecord& record) {
 void RestoreProgress::hear(const CoordinatorEvent& event) {
   const MutexLock lock(_mutex);
   const auto place = _places.find(event.bundleID);
-  if (place == _places.end() || _applications[place->second].state != State::SetUp) return;
-  if (event.error) {
-    change(_applications[place->second], State::Failed, reasonText(*event.error));
-  } else if (event.kind == CoordinatorEvent::Kind::PlaceholderInstalled) {
-    change(_applications[place->second], State::Placed, "");
+  if (place == _places.end()) return;
+  Application& application = _applications[place->second];
+  const bool isSetUp = application.state == State::SetUp;
+  if (event.error && (isSetUp || application.state == State::Present)) {
+    change(application, State::Failed, reasonText(*event.error));
+  } else if (event.kind == CoordinatorEvent::Kind::PlaceholderInstalled && isSetUp) {
+    change(application, State::Placed, "");
   }
 }
 
@@ -169,7 +184,7 @@ void RestoreProgress::change(Application& application, State state, const std::s
   if (displayWidth(text) < kIdentifierWidth) text = fitted(text, kIdentifierWidth);
   text += "  " + std::string(word);
   if (state == State::Placed && application.installType) text += "   " + installTypeText(*application.installType);
-  if (state == State::Present) text += "  set up already";
+  if (state == State::Present) text += application.isTheStores ? "  left to the store" : "  set up already";
   if (!why.empty()) text += std::string(9 - word.size(), ' ') + why;
   print(text, state == State::Failed);
 }
@@ -179,8 +194,7 @@ void RestoreProgress::change(Application& application, State state, const std::s
 void RestoreProgress::beginWait(std::string_view message) {
   const auto arguments = argumentsOfLine(kWaits, message);
   if (!arguments || arguments->size() != 2) return;
-  _awaited = static_cast<std::int64_t>(lastNumber(arguments->at(1)));
-  if (_awaited == 0) return;
+  if (lastNumber(arguments->at(1)) == 0) return;
   _waitBegin = Clock::now();
   _deadline = _waitBegin + std::chrono::seconds(lastNumber(arguments->at(0)));
   _isWaiting = true;
@@ -197,14 +211,12 @@ std::string RestoreProgress::waitText() const {
     if (application.state == State::SetUp) pending.push_back(printable(application.identifier));
   }
   const auto left = std::chrono::ceil<std::chrono::seconds>(std::max(_deadline - Clock::now(), Clock::duration(0)));
-  const std::string most = ", at most " + std::to_string(left.count()) + " s";
-  const std::string what =
-      "waiting for " + counted(static_cast<std::size_t>(_awaited), "placeholder", "placeholders") + most;
-  if (pending.empty()) return what + ": all are installed, but the client has not heard of it";
+  const std::string most = "at most " + std::to_string(left.count()) + " s";
+  if (pending.empty()) return "waiting " + most + ": the client has not heard of every placeholder";
   std::string names;
   for (std::size_t i = 0; i < std::min(pending.size(), kNamesShown); ++i) names += (i > 0 ? ", " : "") + pending[i];
   if (pending.size() > kNamesShown) names += " and " + std::to_string(pending.size() - kNamesShown) + " more";
-  return what + ": " + names;
+  return "waiting for " + counted(pending.size(), "placeholder", "placeholders") + ", " + most + ": " + names;
 }
 
 void RestoreProgress::drawWait() {

@@ -34,6 +34,7 @@ class RestoreProgress : public LogSink {
     std::string identifier;
     State state = State::Begun;
     std::string why;                           // Skipped, Failed
+    bool isTheStores = false;                  // Present: the store answers for it
     std::optional<std::uint64_t> installType;  // of the placeholder, once it is made
   };
 
@@ -77,7 +78,6 @@ class RestoreProgress : public LogSink {
   std::string _reason APPSYNC_GUARDED_BY(_mutex);  // the last error told of the application that is being set up
   std::optional<std::string> _listProblem APPSYNC_GUARDED_BY(_mutex);
   std::vector<std::string> _otherProblems APPSYNC_GUARDED_BY(_mutex);
-  std::int64_t _awaited APPSYNC_GUARDED_BY(_mutex) = 0;
   bool _isWaiting APPSYNC_GUARDED_BY(_mutex) = false;
   bool _isDrawn APPSYNC_GUARDED_BY(_mutex) = false;  // the line of the wait stands there
   Clock::time_point _waitBegin APPSYNC_GUARDED_BY(_mutex);

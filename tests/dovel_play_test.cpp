@@ -142,6 +142,8 @@ TEST_F(PlayTest, WhatAnArgumentMayBe) {
       {R"({"do": 5})", "\"do\" that must be a text"},
       {R"({"do": "reconcileSync", "type": -2147483649})", "at most 32 bits"},
       {R"({"do": "reconcileSync", "type": 1.5})", "at most 32 bits"},
+      {R"({"do": "reconcileSync", "type": -1})", "below 0"},
+      {R"({"do": "reconcileRestoreOfType", "type": 2147483648})", "larger than a signed number"},
       {R"({"do": "reconcileSync", "type": 18446744073709551615})", "at most 32 bits"},
       {R"({"do": "reconcileSync", "newAnchor": null})", "\"newAnchor\" that must be a text"},
       {R"({"do": "syncEndedWithSuccess", "success": 1})", "must be true or false"},

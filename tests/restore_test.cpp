@@ -174,6 +174,7 @@ TEST(Restore, TheListOfDemotedApplicationsIsOptional) {
       types += (types.empty() ? "" : " ") + placeholderText(world, id).substr(0, 1);
     }
     EXPECT_EQ(types, one.types) << content;
+    EXPECT_EQ(lines.find("demoted apps list") != std::string::npos, *one.line != 0) << content << "\n" << lines;
     EXPECT_NE(lines.find(one.line), std::string::npos) << content << "\n" << lines;
     EXPECT_NE(lines.find("log 15: com.zelk.kest.Dovel.AppSync|Demoted Apps: "), std::string::npos);
   }
