@@ -147,11 +147,10 @@ void printSummary(const RestoreReport& report, std::int32_t type, Console& conso
   std::array<char, 32> seconds{};
   std::snprintf(seconds.data(), seconds.size(), "%.1f s", report.waited.count());
   if (!report.applications.empty()) console.line("");
+  const std::string unfinished = count(State::SetUp);
   console.line(count(State::Placed) + " placed, " + count(State::Present) + " present, " + count(State::Skipped) +
-               " skipped, " +
-               std::to_string(std::count_if(report.applications.begin(), report.applications.end(),
-                                            [](const auto& application) { return application.hasFailed; })) +
-               " failed; waited " + seconds.data());
+               " skipped, " + count(State::Failed) + " failed" +
+               (unfinished == "0" ? "" : ", " + unfinished + " unfinished") + "; waited " + seconds.data());
 }
 
 }  // namespace
