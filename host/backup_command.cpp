@@ -48,9 +48,9 @@ bool isUntidy(Device& device, const std::string& identifier) {
 }
 
 std::string cell(const Json& value) {
-  if (value.is_null()) return "-";
-  if (value == "") return "(empty)";
-  return printable(value.is_string() ? value.get<std::string>() : jsonLine(value));
+  if (!value.is_string()) return value.is_null() ? "-" : jsonLine(value);
+  const std::string text = printable(value.get<std::string>());
+  return text.empty() ? "(empty)" : text;
 }
 
 void printAccounts(const Json& accounts, Console& console) {
