@@ -40,7 +40,7 @@ std::string whatWouldMend(int errorNumber) {
     case ENFILE:
       return "; raise the limit of open files";
     case EFBIG:
-      return "; the largest file that can be read is 256 MiB";
+      return "; a file can have 256 MiB at most, and no more than the process may write";
     default:
       return "";
   }

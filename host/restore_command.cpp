@@ -108,8 +108,9 @@ class RestoreRun {
     const auto placeholder = _device.registry().applicationProxyForIdentifier(application.identifier, true);
     if (placeholder) result.installType = placeholder->installType;
     if (!application.why.empty()) result.error = application.why;
-    if (application.state == State::SetUp) result.error = "its placeholder has not been installed";
-    if (application.state == State::Present && !placeholder) result.error = "the store is responsible for it";
+    const bool isMissing = application.state == State::Present && !placeholder;
+    if (application.state == State::SetUp || isMissing) result.error = "its placeholder has not been installed";
+    if (isMissing && application.isTheStores) result.error = "the store is responsible for it";
     result.hasFailed = application.state == State::Failed || application.state == State::SetUp;
     return result;
   }

@@ -134,6 +134,15 @@ TEST_F(RefusalsTest, AFailureOnTheWayIsSaidWithItsCureAndNothingElse) {
   EXPECT_EQ(cut.status, 3) << "only the end of the trace was missing";
   EXPECT_EQ(cut.out, "");
 
+  // A backup that does not fit leaves the lists of the one before.
+  ASSERT_EQ(dovel({"restore", "--device", at("device"), "--type", "1", backup}).status, 0);
+  const auto lists = treeOf(at("device/var/mobile/Media/TarvoRestore"));
+  const Outcome full = dovelWithLimit(1024, {"restore", "--device", at("device"), backup});
+  EXPECT_EQ(full.status, 3);
+  EXPECT_NE(full.err.find("File too large"), std::string::npos) << full.err;
+  EXPECT_EQ(lists.size(), 1U);
+  EXPECT_EQ(treeOf(at("device/var/mobile/Media/TarvoRestore")), lists);
+
   // An output that fails at once lets nothing be shown of the run.
   for (const Arguments& command : std::vector<Arguments>{{"sync", host}, {"restore", backup}}) {
     for (const char* output : {"--log", "--trace"}) {
