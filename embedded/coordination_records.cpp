@@ -209,6 +209,7 @@ void EmbeddedCoordination::loadRecords() {
       coordinator->isPlaceholderInstalled = !_registry.removePlaceholder(bundleID, nullptr);
       _store.save(name, coordinatorRecord(*coordinator), nullptr);
     }
+    if (coordinator->isPlaceholderInstalled) coordinator->placeholder->icon.reset();  // the registry has its own copy
     _coordinators[bundleID] = coordinator;
   }
 }

@@ -30,12 +30,18 @@ bool notWritable(const Error& error, Failure& failure) {
   return false;
 }
 
-// What has been copied takes the place of what is there; where nothing has been copied that goes.
-bool putInPlace(EmbeddedFileManager& files, const List& list, Failure& failure) {
+// What has been copied takes the place of what is there; where nothing has been copied that goes. The list of what to
+// restore goes first and comes last: it never stands beside another backup's demoted ones.
+bool putInPlace(EmbeddedFileManager& files, Failure& failure) {
   std::optional<Error> error;
-  bool done = !files.fileExists(list.place()) || files.removeItem(list.place(), &error);
-  if (done && files.fileExists(list.incoming())) done = files.moveItem(list.incoming(), list.place(), &error);
-  return done || notWritable(*error, failure);
+  for (const List& list : kLists) {
+    if (files.fileExists(list.place()) && !files.removeItem(list.place(), &error)) return notWritable(*error, failure);
+  }
+  for (const List& list : {kLists[1], kLists[0]}) {
+    if (!files.fileExists(list.incoming())) continue;
+    if (!files.moveItem(list.incoming(), list.place(), &error)) return notWritable(*error, failure);
+  }
+  return true;
 }
 
 }  // namespace
@@ -48,12 +54,11 @@ std::optional<BackupDirectory> BackupDirectory::open(const std::string& path, co
 }
 
 bool BackupDirectory::push(EmbeddedFileManager& files, const CopySupervision& supervision, Failure& failure) const {
-  const bool isCopied = copyLists(files, supervision, failure);
+  if (copyLists(files, supervision, failure) && putInPlace(files, failure)) return true;
   for (const List& list : kLists) {
-    if (isCopied && !putInPlace(files, list, failure)) return false;
-    if (!isCopied && files.fileExists(list.incoming())) files.removeItem(list.incoming(), nullptr);
+    if (files.fileExists(list.incoming())) files.removeItem(list.incoming(), nullptr);
   }
-  return isCopied;
+  return false;
 }
 
 // Beside their places, so that a list that cannot be read leaves those of an earlier backup as they are.

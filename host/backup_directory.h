@@ -23,7 +23,8 @@ class BackupDirectory {
 
   // Puts a copy of its lists in place on the device; what the backup lacks is not there afterwards either. False, with
   // the failure said, when something cannot be read or written, or when it was stopped (then the failure stays
-  // untouched); of a backup that cannot be read nothing is put in place.
+  // untouched); of a backup that cannot be read nothing is put in place, and whatever fails, no list of what to restore
+  // stands there beside demoted ones of another backup.
   bool push(EmbeddedFileManager& files, const CopySupervision& supervision, Failure& failure) const;
 
   const std::string& path() const { return _path; }

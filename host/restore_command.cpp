@@ -31,7 +31,8 @@ struct RestoredApplication {
 
 struct RestoreReport {
   int interruptedWith = 0;  // the exit status of an interrupted run; 0: it went to its end
-  bool agreed = true;       // the client did not answer NO
+  bool hasBegun = false;    // the client was called
+  bool agreed = true;       // it did not answer NO
   std::optional<std::string> error;
   std::vector<RestoredApplication> applications;
   std::array<std::size_t, 6> counts{};  // by state
@@ -77,6 +78,7 @@ class RestoreRun {
     _device.startWork();
     _session.announceStartup();
     if (isInterrupted()) return true;
+    _report.hasBegun = true;
     std::optional<Error> error;
     _report.agreed = _session.client().reconcileRestoreOfType(_options.type, &error);
     if (error) _report.error = reasonText(*error);
@@ -139,7 +141,9 @@ Json documentOf(const RestoreReport& report) {
 }
 
 void printSummary(const RestoreReport& report, std::int32_t type, Console& console) {
-  if (report.applications.empty() && !report.error) {
+  if (!report.hasBegun) {
+    console.line("Interrupted before the restore began.");
+  } else if (report.applications.empty() && !report.error) {
     const bool isKnown = type == 2 || type == 3;
     console.line(isKnown ? "The backup lists no applications."
                          : "A restore of type " + std::to_string(type) + " brings none back; types 2 and 3 do.");

@@ -3,6 +3,7 @@
 #include <algorithm>
 #include <array>
 #include <charconv>
+#include <system_error>
 
 #include "host/failure.h"
 #include "host/sync_log.h"
@@ -199,24 +200,28 @@ void RestoreProgress::beginWait(std::string_view message) {
   _deadline = _waitBegin + std::chrono::seconds(lastNumber(arguments->at(0)));
   _isWaiting = true;
   if (_drawsInPlace) {
-    _drawer = std::thread([this] { drawWait(); });
-  } else {
-    _console.line(waitText());
+    try {
+      _drawer = std::thread([this] { drawWait(); });
+      return;
+    } catch (const std::system_error&) {
+      // Without a thread to draw it, the wait is said once.
+    }
   }
+  _console.line(waitText());
 }
 
 std::string RestoreProgress::waitText() const {
-  std::vector<std::string> pending;
+  std::size_t pending = 0;
+  std::string names;
   for (const Application& application : _applications) {
-    if (application.state == State::SetUp) pending.push_back(printable(application.identifier));
+    if (application.state != State::SetUp || ++pending > kNamesShown) continue;
+    names += (names.empty() ? "" : ", ") + printable(application.identifier);
   }
   const auto left = std::chrono::ceil<std::chrono::seconds>(std::max(_deadline - Clock::now(), Clock::duration(0)));
   const std::string most = "at most " + std::to_string(left.count()) + " s";
-  if (pending.empty()) return "waiting " + most + ": the client has not heard of every placeholder";
-  std::string names;
-  for (std::size_t i = 0; i < std::min(pending.size(), kNamesShown); ++i) names += (i > 0 ? ", " : "") + pending[i];
-  if (pending.size() > kNamesShown) names += " and " + std::to_string(pending.size() - kNamesShown) + " more";
-  return "waiting for " + counted(pending.size(), "placeholder", "placeholders") + ", " + most + ": " + names;
+  if (pending == 0) return "waiting " + most + ": the client has not heard of every placeholder";
+  if (pending > kNamesShown) names += " and " + std::to_string(pending - kNamesShown) + " more";
+  return "waiting for " + counted(pending, "placeholder", "placeholders") + ", " + most + ": " + names;
 }
 
 void RestoreProgress::drawWait() {

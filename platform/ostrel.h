@@ -164,8 +164,8 @@ class OstrelService {
   // For a log line: what it is and which application it belongs to.
   virtual std::string description(OstrelRef object) = 0;
 
-  // One hold less. When the last is gone the service may act on the object: a coordinator that has a configured
-  // placeholder begins its work. Never fails; a reference of 0 is ignored.
+  // One hold less. When the last is gone the service may act on the object: a coordinator that has a placeholder
+  // begins its work. Never fails; a reference of 0 is ignored.
   virtual void release(OstrelRef object) = 0;
 
   // --- the service itself -------------------------------------------------------------------------------------------

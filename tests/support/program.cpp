@@ -65,7 +65,8 @@ Outcome runProgram(const std::string& program, const Arguments& arguments,
   return run;
 }
 
-Outcome dovelOnTerminal(const Arguments& arguments, unsigned short columns, unsigned short rows, const char* kind) {
+Outcome dovelOnTerminal(const Arguments& arguments, unsigned short columns, unsigned short rows, const char* kind,
+                        const std::function<void(pid_t, const std::string&)>& watch) {
   winsize size{};
   size.ws_row = rows;
   size.ws_col = columns;
@@ -83,6 +84,7 @@ Outcome dovelOnTerminal(const Arguments& arguments, unsigned short columns, unsi
   std::array<char, 4096> bytes{};
   for (ssize_t count = 0; (count = ::read(terminal, bytes.data(), bytes.size())) > 0;) {
     run.out.append(bytes.data(), static_cast<std::size_t>(count));
+    if (watch) watch(process, run.out);
   }
   int status = 0;
   ::waitpid(process, &status, 0);

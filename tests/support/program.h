@@ -36,7 +36,7 @@ Outcome runProgram(const std::string& program, const Arguments& arguments,
 Outcome dovel(const Arguments& arguments, const std::function<void(pid_t, const std::string&)>& watch = {});
 // The same on a terminal of this many columns and rows; `out` is all that it shows.
 Outcome dovelOnTerminal(const Arguments& arguments, unsigned short columns, unsigned short rows,
-                        const char* kind = "xterm");
+                        const char* kind = "xterm", const std::function<void(pid_t, const std::string&)>& watch = {});
 
 std::string contentOf(const fs::path& path);
 void write(const fs::path& path, const std::string& content);
