@@ -85,6 +85,9 @@ class EmbeddedCoordination : public OstrelService {
   // Begins no further placeholder or install: what is being done is finished, the rest is a later process's.
   void stopWork();
 
+  // Whether a later process will know of a coordinator of this application.
+  bool isRecorded(const std::string& bundleID) const;
+
   // Finishes the work that is queued, writes down what is not yet written and begins nothing more: no callback runs
   // when this returns, and none is to come. Not to be called from a callback.
   void drain();

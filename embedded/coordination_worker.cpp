@@ -86,6 +86,10 @@ void EmbeddedCoordination::stopWork() {
   _working = false;
 }
 
+bool EmbeddedCoordination::isRecorded(const std::string& bundleID) const {
+  return _store.load(coordinatorRecordName(bundleID), nullptr).has_value();
+}
+
 void EmbeddedCoordination::consider(const std::shared_ptr<InstallCoordinator>& coordinator) {
   if (coordinator->isScheduled || _drained || nextStep(*coordinator) == Step::None) return;
   coordinator->isScheduled = true;

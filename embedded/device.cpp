@@ -81,10 +81,7 @@ std::unique_ptr<Device> Device::open(const DeviceOptions& options, ErrorOut erro
   files.removeLeftTemporaryFiles();
   std::optional<Error> reason;
   if (!repairStateRecords(files, isCoordinatorRecord, ground.repairs, &reason)) {
-    setError(error, deviceError(kDeviceUnusable,
-                                "The records of the device in \"" + directory +
-                                    "\" cannot be read; make them readable, or move the directory away",
-                                reason));
+    setError(error, unreadableRecordsError(directory, *reason));
     return nullptr;
   }
   for (const std::string& repair : ground.repairs) ground.sink->line(LogLevel::Error, "0", "%@", repair);

@@ -81,6 +81,13 @@ Error notADeviceError(const std::string& directory) {
                                           "that holds a device");
 }
 
+Error unreadableRecordsError(const std::string& directory, const Error& reason) {
+  return deviceError(kDeviceUnusable,
+                     "The records of the device in \"" + directory +
+                         "\" cannot be read; make them readable, or move the directory away",
+                     reason);
+}
+
 std::optional<DeviceDirectory> lookAtDeviceDirectory(const std::string& directory, Disk& disk, ErrorOut error) {
   if (directory.empty() || directory.find('\0') != std::string::npos) {
     setError(error, deviceError(kDeviceUnusable, "\"" + directory + "\" cannot be the name of a directory"));

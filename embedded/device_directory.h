@@ -22,5 +22,6 @@ OwnedFile prepareDeviceDirectory(const std::string& directory, Disk& disk, Error
 
 Error deviceError(std::int64_t code, const std::string& text, const std::optional<Error>& reason = std::nullopt);
 Error notADeviceError(const std::string& directory);
+Error unreadableRecordsError(const std::string& directory, const Error& reason);
 
 }  // namespace appsync

@@ -74,6 +74,11 @@ std::optional<PropertyList> Device::status(const std::string& directory, ErrorOu
     return std::nullopt;
   }
   EmbeddedFileManager files(directory, disk);
+  std::optional<Error> reason;
+  if (!canListStateRecords(files, &reason)) {
+    setError(error, unreadableRecordsError(directory, *reason));
+    return std::nullopt;
+  }
   const std::unique_ptr<StateStore> store = makeFileStateStore(files);
   PropertyList status = PropertyList::dictionary();
   status.set("installed", registryInstalledStatus(*store));

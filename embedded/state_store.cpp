@@ -120,6 +120,12 @@ bool repairRecord(EmbeddedFileManager& files, const std::string& path, const Rec
   return true;
 }
 
+// Also of one that cannot be opened.
+bool isDirectory(EmbeddedFileManager& files, const std::string& path) {
+  const std::optional<FileInformation> information = files.attributesOfItem(path, nullptr);
+  return information && information->isDirectory;
+}
+
 bool repairRecordsIn(EmbeddedFileManager& files, const std::string& directory, int depth,
                      const RecordCheck& isMeaningful, std::vector<std::string>& repairs, ErrorOut error) {
   const auto names = files.contentsOfDirectory(directory, error);
@@ -128,7 +134,7 @@ bool repairRecordsIn(EmbeddedFileManager& files, const std::string& directory, i
     const std::string path = std::string(directory).append("/").append(name);
     if (name.ends_with(kRecordSuffix)) {
       if (!repairRecord(files, path, isMeaningful, repairs, error)) return false;
-    } else if (depth > 0 && files.isDirectory(path)) {
+    } else if (depth > 0 && isDirectory(files, path)) {
       if (!repairRecordsIn(files, path, depth - 1, isMeaningful, repairs, error)) return false;
     }
   }
@@ -145,6 +151,15 @@ bool repairStateRecords(EmbeddedFileManager& files, const RecordCheck& isMeaning
                         ErrorOut error) {
   EmbeddedFileManager own = files.ownFiles();
   return repairRecordsIn(own, kStateDirectory, 1, isMeaningful, repairs, error);
+}
+
+bool canListStateRecords(EmbeddedFileManager& files, ErrorOut error) {
+  EmbeddedFileManager own = files.ownFiles();
+  const auto names = own.contentsOfDirectory(kStateDirectory, error);
+  return names && std::ranges::all_of(*names, [&](const std::string& name) {
+           const std::string path = std::string(kStateDirectory).append("/").append(name);
+           return !isDirectory(own, path) || own.contentsOfDirectory(path, error).has_value();
+         });
 }
 
 bool isSinglePathComponent(const std::string& text) {

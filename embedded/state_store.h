@@ -47,6 +47,9 @@ using RecordCheck = std::function<bool(const std::string& name, const PropertyLi
 bool repairStateRecords(EmbeddedFileManager& files, const RecordCheck& isMeaningful, std::vector<std::string>& repairs,
                         ErrorOut error);
 
+// Whether every collection can be listed: one that cannot is not empty. The error names the directory.
+bool canListStateRecords(EmbeddedFileManager& files, ErrorOut error);
+
 // Whether this can be the name of one file or directory of an application: not empty, not "." or "..", no "/" and no
 // NUL, valid UTF-8 and at most 200 bytes. The services of the device refuse every other bundle identifier.
 bool isSinglePathComponent(const std::string& text);

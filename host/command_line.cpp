@@ -2,8 +2,11 @@
 
 #include <CLI/CLI.hpp>
 #include <algorithm>
+#include <span>
 #include <sstream>
+#include <string>
 #include <string_view>
+#include <vector>
 
 #include "host/commands.h"
 
@@ -49,6 +52,19 @@ std::string isNamed(const std::string& text) {
   return text.empty() ? "an empty text names nothing" : "";
 }
 
+// The arguments as CLI11 takes them, the last one first. It reads "--option=" as an option whose value is the next
+// argument; here that is an option with an empty value.
+std::vector<std::string> argumentsToParse(int argumentCount, const char* const* arguments) {
+  std::vector<std::string> all;
+  for (const std::string argument : std::span(arguments, static_cast<std::size_t>(argumentCount)).subspan(1)) {
+    const bool isEmptyValue = argument.starts_with("--") && argument.find('=') == argument.size() - 1;
+    all.push_back(isEmptyValue ? argument.substr(0, argument.size() - 1) : argument);
+    if (isEmptyValue) all.emplace_back();
+  }
+  std::reverse(all.begin(), all.end());
+  return all;
+}
+
 class Grammar {
  public:
   Grammar() : _app("Syncs applications to a device that lives in a directory.", "dovel") {
@@ -68,7 +84,7 @@ class Grammar {
   Invocation parse(int argumentCount, const char* const* arguments) {
     Invocation invocation;
     try {
-      _app.parse(argumentCount, arguments);
+      _app.parse(argumentsToParse(argumentCount, arguments));
     } catch (const CLI::Success& asked) {
       std::ostringstream text;
       _app.exit(asked, text, text);

@@ -27,6 +27,7 @@ struct RestoredApplication {
   std::optional<std::uint64_t> installType;  // of its placeholder; absent when there is none
   std::optional<std::string> error;
   bool hasFailed = false;
+  bool isForgotten = false;  // its coordinator could not be written down
 };
 
 struct RestoreReport {
@@ -106,14 +107,19 @@ class RestoreRun {
   bool isInterrupted() { return _session.interrupt().signal() != 0; }
 
   RestoredApplication resultOf(const RestoreProgress::Application& application) {
-    RestoredApplication result{application.identifier, std::nullopt, std::nullopt, false};
+    RestoredApplication result;
+    result.identifier = application.identifier;
     const auto placeholder = _device.registry().applicationProxyForIdentifier(application.identifier, true);
     if (placeholder) result.installType = placeholder->installType;
     if (!application.why.empty()) result.error = application.why;
     const bool isMissing = application.state == State::Present && !placeholder;
     if (application.state == State::SetUp || isMissing) result.error = "its placeholder has not been installed";
     if (isMissing && application.isTheStores) result.error = "the store is responsible for it";
-    result.hasFailed = application.state == State::Failed || application.state == State::SetUp;
+    if (application.state == State::Placed && !_device.coordination().isRecorded(application.identifier)) {
+      result.isForgotten = true;
+      result.error = "its coordinator could not be written down, so that later runs do not know it";
+    }
+    result.hasFailed = application.state == State::Failed || application.state == State::SetUp || result.isForgotten;
     return result;
   }
 
@@ -138,6 +144,17 @@ Json documentOf(const RestoreReport& report) {
           {"error", orNull(report.error)},
           {"applications", applications},
           {"waited", report.waited.count()}};
+}
+
+void sayWhatIsForgotten(const RestoreReport& report, Console& console) {
+  const auto isForgotten = [](const RestoredApplication& application) { return application.isForgotten; };
+  const auto& all = report.applications;
+  const auto count = static_cast<std::size_t>(std::count_if(all.begin(), all.end(), isForgotten));
+  if (count == 0) return;
+  const auto& first = *std::find_if(all.begin(), all.end(), isForgotten);
+  console.problem("the coordinators of " + counted(count, "application", "applications") +
+                  " could not be written down, so that later runs do not know them, the first of \"" +
+                  printable(first.identifier) + "\"; see that the device's directory can be written");
 }
 
 void printSummary(const RestoreReport& report, std::int32_t type, Console& console) {
@@ -176,6 +193,7 @@ int runRestore(const RestoreOptions& options, Console& console) {
   if (!session->close(failure)) return console.fail(failure);
   if (report.error) console.problem(*report.error);
   for (const std::string& line : progress.otherProblems()) console.problem(line);
+  sayWhatIsForgotten(report, console);
   console.document(documentOf(report));
   printSummary(report, options.type, console);
   return report.status();

@@ -89,7 +89,8 @@ std::unique_ptr<Session> Session::open(const SessionOptions& options, Console& c
     return nullptr;
   }
   std::unique_ptr<Session> session(new Session);
-  if (!session->_interrupt.start(failure) || !session->openOutputs(options, console, failure)) return nullptr;
+  // To open a pipe that nobody reads yet takes until somebody does: a signal meanwhile ends the program itself.
+  if (!session->openOutputs(options, console, failure) || !session->_interrupt.start(failure)) return nullptr;
   if (options.loadsPlugin || options.common.plugin) {
     session->_plugin = Plugin::load(options.common.plugin, failure);
     if (!session->_plugin) return nullptr;

@@ -324,6 +324,13 @@ TEST_F(OutputTest, ClosedStandardStreamsDoNotSpillIntoFiles) {
   EXPECT_EQ(entryOf(status()["todo"], "org.sample.notes")["operation"], "INSTALLED");
 }
 
+TEST_F(OutputTest, ASignalEndsTheWaitForAReaderOfTheLog) {
+  ASSERT_EQ(::mkfifo(at("pipe").c_str(), 0600), 0);
+  const Outcome run = runProgram("/usr/bin/timeout", {"--kill-after=5", "0.3", kProgram, "settings", "--device",
+                                                      at("device"), "--log", at("pipe")});
+  EXPECT_EQ(run.status, 124);  // ended by the first signal
+}
+
 TEST_F(OutputTest, QuietSaysOnlyWhatFailed) {
   const std::string host = sampleHost("host", 2, 1);
   EXPECT_EQ(sync(host, {"--quiet"}).out, "");

@@ -83,6 +83,8 @@ TEST_F(RefusalsTest, ARefusedRunChangesNothing) {
   const std::vector<Case> cases{
       {{"status", "--device", device, "--fault", "nonsense"}, 2, "unknown-fault"},
       {{"status", "--device", device, "--log", at("none/log")}, 3, "output-unwritable"},
+      {{"settings", "--log=", "--device", device}, 3, "output-unwritable"},
+      {{"settings", "--device="}, 2, "command-line"},
       {{"status", "--device", device, "--plugin", at("none.so")}, 3, "plugin-unusable"},
       {{"status", "--device", at("none"), "--log", at("old"), "--trace", at("old2")}, 3, "device-missing"},
       {{"settings", "--device", device, "--plugin", at("none.so")}, 3, "plugin-unusable"},

@@ -205,6 +205,18 @@ TEST_F(RestoreRunTest, WhatComesOfIt) {
   EXPECT_TRUE(fs::is_empty(fs::path(at(kPlacedList)).parent_path()));
 }
 
+// A later run would take its placeholder for one that nobody answers for.
+TEST_F(RestoreRunTest, AnApplicationWhoseCoordinatorCannotBeWrittenDownFails) {
+  dovel({"settings", "--device", at("device")});
+  write(at("device/state/coordinators"), "in the way");
+  const Outcome run = restore(sampleBackup());
+  EXPECT_EQ(run.status, 1) << run.out;
+  EXPECT_NE(run.err.find("the coordinators of 3 applications could not be written down"), std::string::npos) << run.err;
+  const Json kept = entryOf(run.json()["applications"], "org.kept");
+  EXPECT_EQ(kept["placeholder"], true);
+  EXPECT_EQ(kept["error"], "its coordinator could not be written down, so that later runs do not know it");
+}
+
 TEST_F(RestoreRunTest, WhatIsTheStoresAlreadyIsLeftToIt) {
   seed(R"({"coordinators": [{"identifier": "org.kept", "kind": "restoring", "creator": 3, "responsibleClient": 1}]})");
   const Outcome run = restore(sampleBackup());
