@@ -103,8 +103,8 @@ void restore(benchmark::State& state) {
   const auto applications = static_cast<double>(count * state.iterations());
   state.counters["cpu_us"] = time / applications;
   state.counters["icon_blocks"] = static_cast<double>(blocks) / applications;
-  if (static_cast<double>(blocks) > 2.1 * applications)
-    state.SkipWithError("an icon is copied more often than it must");
+  const bool isWasteful = static_cast<double>(blocks) > 2.1 * applications;
+  if (isWasteful) state.SkipWithError("an icon is copied more often than it must");
 }
 
 BENCHMARK(restore)->Arg(250)->Arg(500)->Arg(1000)->Arg(2000)->Iterations(1)->Unit(benchmark::kMillisecond);

@@ -21,17 +21,17 @@ class StrandExecutor : public Executor {
  public:
   StrandExecutor(unsigned threads, std::optional<std::uint64_t> seed) {
     if (seed) _choice.emplace(*seed);
-    for (unsigned i = 0; i < threads; ++i) _threads.emplace_back([this] { work(); });
+    try {
+      for (unsigned i = 0; i < threads; ++i) _threads.emplace_back([this] { work(); });
+    } catch (...) {
+      end();
+      throw;
+    }
   }
 
   ~StrandExecutor() override {
     drain();
-    {
-      const MutexLock lock(_mutex);
-      _ending = true;
-      _changed.notify_all();
-    }
-    for (std::thread& thread : _threads) thread.join();
+    end();
   }
 
   void post(const std::string& strand, Job job) override {
@@ -55,6 +55,15 @@ class StrandExecutor : public Executor {
   }
 
  private:
+  void end() {
+    {
+      const MutexLock lock(_mutex);
+      _ending = true;
+      _changed.notify_all();
+    }
+    for (std::thread& thread : _threads) thread.join();
+  }
+
   void work() {
     std::string strand;
     while (std::optional<Job> job = take(strand)) {

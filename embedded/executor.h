@@ -26,7 +26,7 @@ class Executor {
   virtual bool isIdle() = 0;
 };
 
-// Threads of its own; the destructor drains.
+// Threads of its own; the destructor drains. Throws `std::system_error` when the machine has no thread to give.
 std::unique_ptr<Executor> makeThreadExecutor(unsigned threads);
 
 // One thread of its own that takes, of all strands that have a job, the one that the seed says: the same seed and the

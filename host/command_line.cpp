@@ -2,7 +2,6 @@
 
 #include <CLI/CLI.hpp>
 #include <algorithm>
-#include <span>
 #include <sstream>
 #include <string>
 #include <string_view>
@@ -56,8 +55,12 @@ std::string isNamed(const std::string& text) {
 // argument; here that is an option with an empty value.
 std::vector<std::string> argumentsToParse(int argumentCount, const char* const* arguments) {
   std::vector<std::string> all;
-  for (const std::string argument : std::span(arguments, static_cast<std::size_t>(argumentCount)).subspan(1)) {
-    const bool isEmptyValue = argument.starts_with("--") && argument.find('=') == argument.size() - 1;
+  bool areOptionsOver = false;
+  for (int i = 1; i < argumentCount; ++i) {
+    const std::string argument = arguments[i];
+    areOptionsOver = areOptionsOver || argument == "--";
+    const bool isEmptyValue =
+        !areOptionsOver && argument.starts_with("--") && argument.find('=') == argument.size() - 1;
     all.push_back(isEmptyValue ? argument.substr(0, argument.size() - 1) : argument);
     if (isEmptyValue) all.emplace_back();
   }

@@ -5,6 +5,8 @@
 #include <csignal>
 #include <exception>
 #include <optional>
+#include <string>
+#include <system_error>
 
 #include "host/command_line.h"
 #include "host/console.h"
@@ -34,6 +36,9 @@ int carryOut(const Invocation& invocation, Console& console) {
     return invocation.run(console);
   } catch (const std::bad_alloc&) {
     return console.fail({FailureCode::Internal, "there is not enough memory", "free some, or use smaller input"});
+  } catch (const std::system_error& error) {
+    return console.fail({FailureCode::Internal, std::string("the system refused: ") + error.what(),
+                         "raise the limits of processes and open files"});
   } catch (const std::exception& exception) {
     return console.fail({FailureCode::Internal,
                          std::string("something went wrong that should not: ") + exception.what(), "please report it"});
